@@ -1,0 +1,41 @@
+// The tick scheduler's library-wide state.
+//
+// Shared by the timer thread (tick service) and any number of caller threads.
+// Every word is a relaxed atomic and every ClockTime a single 64-bit atomic,
+// so no reader sees a torn time and the state is data-race free. Decisions
+// that must agree with each other (list links, the arming of the earliest
+// deadline) are made under gSchedLock; see WaitList.h.
+#ifndef QUELTA_ENGINE_SCHEDULERSTATE_H
+#define QUELTA_ENGINE_SCHEDULERSTATE_H
+
+#include <atomic>
+#include <cstdint>
+
+#include "engine/ClockTimeOps.h"
+#include "quelta/ClockTime.h"
+
+namespace quelta {
+
+struct WaitNode;
+
+extern AtomicClockTime gNextTick;               // next 1 ms tick (monotonic)
+extern AtomicClockTime gTickPeriod;             // 0 at load, 1,000,000 at start
+extern AtomicClockTime gNextDeadline;           // armed / earliest found so far
+extern AtomicClockTime gMonotonicCallbackTime;  // NeverTime = none
+extern AtomicClockTime gGlobalCallbackTime;     // on the global clock
+extern std::atomic<QueltaCallbackFn> gCallbackFn;
+extern std::atomic<void*> gCallbackArg;
+extern std::atomic<QueltaTickCallbackFn> gTickCallback;
+extern std::atomic<uint32_t> gGeneration;       // no writer in the library
+extern std::atomic<WaitNode*> gWaitNodePool;    // 128 nodes, or null
+extern std::atomic<WaitNode*> gFreeList;
+extern std::atomic<WaitNode*> gWaitList;
+extern std::atomic<uint32_t> gEventSystemReady;
+extern std::atomic<uint32_t> gWaitListVersion;
+extern std::atomic<uint32_t> gControlFlag;
+
+constexpr uint64_t kTickPeriodClocks = 1000000;
+
+}  // namespace quelta
+
+#endif

@@ -1,0 +1,108 @@
+// Wait nodes, the free list and the deadline-sorted wait list.
+//
+// Concurrency design
+// ------------------
+// Every node is always in exactly one place: free, held by a caller, queued,
+// or being fired. Links (`next`, `prev`), the list heads, node `state`, the
+// version counter and the arming of the earliest deadline change only under
+// gSchedLock, a priority-inheriting mutex. Its critical sections are short
+// list operations: a walk of at most 128 nodes (each global-clock node costs
+// one clock conversion) plus one SetExpiry. The lock is never held across a
+// semaphore post or a callback, so the timer thread never waits for a caller
+// longer than one such operation, and a caller holding it is boosted to the
+// timer thread's priority while the timer thread waits.
+//
+// Firing is split in two: under the lock the tick service unlinks the node
+// and marks it kFiring; without the lock it posts the semaphore and runs the
+// callback; under the lock again it settles the node (free, or kFired and
+// left with its holder). A holder's ReleaseWaitNode of a node that is being
+// fired waits until the firing is settled (unless it runs on the timer thread
+// itself, in a callback): after ReleaseWaitNode returns, the library no longer
+// touches that node's semaphore or callback. Releasing a fired-and-unlinked
+// node never touches the wait list. A double release or a pointer that is not
+// a pool node is refused with one diagnostic line.
+#ifndef QUELTA_ENGINE_WAITLIST_H
+#define QUELTA_ENGINE_WAITLIST_H
+
+#include <pthread.h>
+
+#include <atomic>
+#include <cstdint>
+
+#include "quelta/ClockTime.h"
+#include "quelta/PalSemaphore.h"
+
+namespace quelta {
+
+constexpr uint32_t kWaitNodeCount = 128;
+
+enum class NodeState : uint32_t {
+    kFree = 0,     // on the free list (or never taken)
+    kHeld = 1,     // taken by a caller, not queued
+    kQueued = 2,   // on the wait list
+    kFiring = 3,   // unlinked by the tick service, post/callback in progress
+    kFired = 4,    // fired and unlinked, held by its holder until released
+};
+
+struct WaitNode {
+    // Fields in the record's documented order.
+    std::atomic<PalSemaphore*> semaphore;
+    std::atomic<uint64_t> deadline;          // ClockTime value (low word first)
+    std::atomic<QueltaWaitCallbackFn> callback;
+    std::atomic<void*> callbackArg;
+    std::atomic<uint32_t> fireCount;
+    std::atomic<uint32_t> isGlobal;
+    std::atomic<WaitNode*> next;
+    std::atomic<WaitNode*> prev;             // kNotQueued before first taking
+    std::atomic<PalSemaphore*> ownSemaphore;
+    std::atomic<uint32_t> autoRelease;
+    std::atomic<uint8_t> abortable;
+    // Beyond the record: where the node is, and a release requested by its
+    // holder while the tick service was firing it.
+    std::atomic<uint32_t> state;
+    std::atomic<uint32_t> releasePending;
+};
+
+// The mark of a node that was never queued: 0xFFFFFFFF on every target.
+inline WaitNode* NotQueuedMark() {
+    return reinterpret_cast<WaitNode*>(static_cast<uintptr_t>(0xFFFFFFFFu));
+}
+
+extern pthread_mutex_t gSchedLock;
+
+// Scoped hold of gSchedLock.
+class SchedLockGuard {
+public:
+    SchedLockGuard();
+    ~SchedLockGuard();
+    SchedLockGuard(const SchedLockGuard&) = delete;
+    SchedLockGuard& operator=(const SchedLockGuard&) = delete;
+};
+
+// The node's effective deadline: its deadline, or for a global-clock node the
+// monotonic equivalent through the engine's GlobalToMonotonicFwd.
+uint64_t EffectiveDeadline(const WaitNode* node);
+
+// Builds a pool in `pool` (zeroed, linked, autoRelease 1, not-queued mark)
+// without semaphores; start-up adds them. Makes it the free list.
+void InitWaitNodePool(WaitNode* pool, uint32_t count);
+
+// Pops the free list; null when it is empty or the event system is not ready.
+WaitNode* TakeFreeNode();
+
+// 0 queued (it may already have fired); 1 no timer, not queued.
+uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
+                        QueltaWaitCallbackFn callback, void* callbackArg);
+void ReleaseWaitNode(WaitNode* node);
+void FireWaitNode(WaitNode* node);  // tick service only
+
+// True when `node` points at a node of the current pool.
+bool IsPoolNode(const WaitNode* node);
+
+// Audit for tests: walks both lists; true when every node is in exactly one
+// place and the wait list is doubly linked. Counts are written when non-null.
+bool AuditWaitNodes(uint32_t* freeCount, uint32_t* queuedCount, uint32_t* heldCount);
+
+}  // namespace quelta
+
+#endif

@@ -1,0 +1,16 @@
+#!/usr/bin/env bash
+# Installs what building and testing need on Debian 12, as root, when missing.
+set -euo pipefail
+want=(cmake g++ make ninja-build googletest libgtest-dev libbenchmark-dev
+      g++-arm-linux-gnueabihf libc6-dev-armhf-cross qemu-user util-linux binutils)
+missing=()
+for p in "${want[@]}"; do
+  dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")
+done
+if ((${#missing[@]})); then
+  echo "installing: ${missing[*]}"
+  if [ "$(id -u)" -ne 0 ]; then echo "need root to install packages" >&2; exit 1; fi
+  export DEBIAN_FRONTEND=noninteractive
+  apt-get update -qq
+  apt-get install -y -qq "${missing[@]}"
+fi

@@ -1,0 +1,22 @@
+// Platform layer: the counting semaphore (record layout in quelta/PalSemaphore.h).
+//
+// count never exceeds waiters + 1: with nobody waiting the semaphore remembers
+// at most one post. Waits take a timeout in milliseconds (negative: none) on
+// CLOCK_MONOTONIC and return 0 taken, 1 timed out, 2 other failure.
+#ifndef QUELTA_TLINUX_PALSEMAPHOREOPS_H
+#define QUELTA_TLINUX_PALSEMAPHOREOPS_H
+
+#include <cstdint>
+
+#include "quelta/PalSemaphore.h"
+
+namespace quelta {
+
+int32_t PalSemaphoreCreate(PalSemaphore** out);
+uint32_t PalSemaphoreWait(PalSemaphore* semaphore, int32_t timeoutMs);
+int32_t PalSemaphorePost(PalSemaphore* semaphore);
+int32_t PalSemaphoreDestroy(PalSemaphore* semaphore);
+
+}  // namespace quelta
+
+#endif

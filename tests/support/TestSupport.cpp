@@ -1,0 +1,43 @@
+#include "TestSupport.h"
+
+#include <dirent.h>
+#include <pthread.h>
+#include <sched.h>
+
+namespace testsupport {
+
+static uint64_t Now(clockid_t id) {
+    timespec ts{};
+    clock_gettime(id, &ts);
+    return static_cast<uint64_t>(ts.tv_sec) * 1000000000ull + static_cast<uint64_t>(ts.tv_nsec);
+}
+
+uint64_t MonoNowNs() { return Now(CLOCK_MONOTONIC); }
+uint64_t RealNowNs() { return Now(CLOCK_REALTIME); }
+
+bool CanUseRealtime() {
+    int policy = 0;
+    sched_param old{};
+    pthread_getschedparam(pthread_self(), &policy, &old);
+    sched_param p{};
+    p.sched_priority = 1;
+    if (pthread_setschedparam(pthread_self(), SCHED_FIFO, &p) != 0) return false;
+    pthread_setschedparam(pthread_self(), policy, &old);
+    return true;
+}
+
+static int CountEntries(const char* path) {
+    DIR* d = opendir(path);
+    if (!d) return -1;
+    int n = 0;
+    while (dirent* e = readdir(d)) {
+        if (e->d_name[0] != '.') ++n;
+    }
+    closedir(d);
+    return n;
+}
+
+int CountThreads() { return CountEntries("/proc/self/task"); }
+int CountOpenFds() { return CountEntries("/proc/self/fd") - 1; }  // minus the DIR's own
+
+}  // namespace testsupport
