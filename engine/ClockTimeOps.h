@@ -69,6 +69,10 @@ public:
     void Store(uint64_t v, std::memory_order mo = std::memory_order_relaxed) {
         value_.store(v, mo);
     }
+    bool CompareExchange(uint64_t expected, uint64_t desired) {
+        return value_.compare_exchange_strong(expected, desired, std::memory_order_acq_rel,
+                                              std::memory_order_relaxed);
+    }
     ClockTime LoadTime() const { return FromU64(Load()); }
     void StoreTime(const ClockTime& t) { Store(ToU64(t)); }
 

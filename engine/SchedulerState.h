@@ -16,8 +16,6 @@
 
 namespace quelta {
 
-struct WaitNode;
-
 extern AtomicClockTime gNextTick;               // next 1 ms tick (monotonic)
 extern AtomicClockTime gTickPeriod;             // 0 at load, 1,000,000 at start
 extern AtomicClockTime gNextDeadline;           // armed / earliest found so far

@@ -15,6 +15,11 @@ uint32_t ArmTimer(const ClockTime& when);
 // True when a timer exists and its thread serves expiries.
 bool TimerServing();
 
+// Bodies of engine slots 54, 55 and 43.
+void RegisterTickCallbackImpl(QueltaTickCallbackFn fn);
+void UnregisterTickCallbackImpl(QueltaTickCallbackFn fn);  // mismatch: cleared, one diagnostic
+void SetControlFlagImpl(uint32_t action);
+
 }  // namespace quelta
 
 #endif

@@ -32,18 +32,8 @@
 #include "quelta/ClockTime.h"
 #include "quelta/PalSemaphore.h"
 
-namespace quelta {
-
-constexpr uint32_t kWaitNodeCount = 128;
-
-enum class NodeState : uint32_t {
-    kFree = 0,     // on the free list (or never taken)
-    kHeld = 1,     // taken by a caller, not queued
-    kQueued = 2,   // on the wait list
-    kFiring = 3,   // unlinked by the tick service, post/callback in progress
-    kFired = 4,    // fired and unlinked, held by its holder until released
-};
-
+// The record of one pending wait. Declared at global scope: the runtime holds
+// nodes as opaque `WaitNode*` handles (quelta/ClockTime.h).
 struct WaitNode {
     // Fields in the record's documented order.
     std::atomic<PalSemaphore*> semaphore;
@@ -63,12 +53,28 @@ struct WaitNode {
     std::atomic<uint32_t> releasePending;
 };
 
+namespace quelta {
+
+constexpr uint32_t kWaitNodeCount = 128;
+
+enum class NodeState : uint32_t {
+    kFree = 0,     // on the free list (or never taken)
+    kHeld = 1,     // taken by a caller, not queued
+    kQueued = 2,   // on the wait list
+    kFiring = 3,   // unlinked by the tick service, post/callback in progress
+    kFired = 4,    // fired and unlinked, held by its holder until released
+};
+
+
 // The mark of a node that was never queued: 0xFFFFFFFF on every target.
 inline WaitNode* NotQueuedMark() {
     return reinterpret_cast<WaitNode*>(static_cast<uintptr_t>(0xFFFFFFFFu));
 }
 
 extern pthread_mutex_t gSchedLock;
+
+// Initialises gSchedLock once (load hook, and tests that build their own pool).
+void InitSchedLock();
 
 // Scoped hold of gSchedLock.
 class SchedLockGuard {
@@ -95,6 +101,17 @@ uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
                         QueltaWaitCallbackFn callback, void* callbackArg);
 void ReleaseWaitNode(WaitNode* node);
 void FireWaitNode(WaitNode* node);  // tick service only
+
+// Tick service helpers. Fires the head when its effective deadline is due at
+// `now` and returns true; otherwise folds the head's deadline into
+// gNextDeadline and returns false (also false for an empty list).
+bool FireHeadIfDue(uint64_t now);
+// Fires every queued global-clock node that is abortable, in list order.
+void FireAbortableGlobalNodes();
+
+// Callers inside node-using waits; the stop waits for them to leave.
+extern std::atomic<int32_t> gActiveNodeWaiters;
+extern std::atomic<bool> gStopping;
 
 // True when `node` points at a node of the current pool.
 bool IsPoolNode(const WaitNode* node);

@@ -1,0 +1,202 @@
+// Start-up, shutdown and the accessors.
+//
+// Start-up order: log engine, clock-conversion call number, timer (its thread
+// parked), timing engine, platform attributes, event system (pool, first tick
+// 1 ms ahead, epoch offset). The stop goes the other way: timer (thread
+// joined), pool and engine, log engine. Whatever a failed start leaves behind
+// is released by the stop, which checks each pointer.
+#include "engine/LibraryFrame.h"
+
+#include <cstdio>
+#include <new>
+
+#include "engine/ClockTimeOps.h"
+#include "engine/EpochOffset.h"
+#include "engine/SchedulerState.h"
+#include "engine/TickService.h"
+#include "engine/TimerArming.h"
+#include "engine/WaitList.h"
+#include "engine/tKPusTimingEngine.h"
+#include "log/tKPLogEngine.h"
+#include "nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.h"
+#include "quelta/quelta.h"
+#include "tLinux/PalMemory.h"
+#include "tLinux/PalSemaphoreOps.h"
+#include "tLinux/PalThreads.h"
+
+namespace quelta {
+
+std::atomic<tKPLogEngine*> gLogEngine{nullptr};
+std::atomic<tKPusLinuxNanoSleepTimer*> gTimer{nullptr};
+std::atomic<tKPusTimingEngine*> gEngine{nullptr};
+std::atomic<uint32_t> gCpuSpeed{0};
+
+namespace {
+
+constexpr std::memory_order kRelaxed = std::memory_order_relaxed;
+constexpr const char* kConvertSyscallFile = "/sys/kernel/zq_syscall_clock_converttime";
+constexpr const char* kInitFailed = "iTSCEvent_Initialize_C FAILED!";
+
+void DeleteLogEngine() {
+    iKPLogEngine* log = gLogEngine.exchange(nullptr, std::memory_order_acq_rel);
+    delete log;  // through the virtual deleting destructor
+}
+
+void DeleteTimer() {
+    iKPusLinuxTimer* timer = gTimer.exchange(nullptr, std::memory_order_acq_rel);
+    delete timer;  // stops and joins its thread
+}
+
+void ReadConvertSyscallNumber() {
+    if (gConvertSyscallNr.load(kRelaxed) != 0) return;
+    FILE* f = std::fopen(kConvertSyscallFile, "r");
+    gConvertSyscallNr.store(-1, kRelaxed);
+    if (f == nullptr) return;
+    int number = -1;
+    if (std::fscanf(f, "%d", &number) == 1) gConvertSyscallNr.store(number, kRelaxed);
+    std::fclose(f);
+}
+
+// Waits, at most kStopWaiterGraceMs, for every caller inside a node-using
+// wait to leave the library's code. True when none is left.
+bool WaitForNodeWaitersToLeave() {
+    for (uint32_t ms = 0; ms < kStopWaiterGraceMs; ++ms) {
+        if (gActiveNodeWaiters.load(std::memory_order_acquire) <= 0) return true;
+        PalSleepMilliseconds(1);
+    }
+    return gActiveNodeWaiters.load(std::memory_order_acquire) <= 0;
+}
+
+}  // namespace
+
+uint32_t LibraryControl(uintptr_t, uintptr_t command, uintptr_t) {
+    if (command == 1) return LibraryStart();
+    if (command != 0) return 1;
+    gStopping.store(true, std::memory_order_release);
+    DeleteTimer();
+    EventSystemStop();
+    DeleteLogEngine();
+    return 1;
+}
+
+uint32_t LibraryStart() {
+    gStopping.store(false, std::memory_order_release);
+    tKPLogEngine* log = tKPLogEngine::Create();
+    if (log == nullptr) {
+        std::puts("Log engine initialization FAILED!");
+        return 0;
+    }
+    gLogEngine.store(log, std::memory_order_release);
+
+    ReadConvertSyscallNumber();
+
+    tKPusLinuxNanoSleepTimer* timer = new tKPusLinuxNanoSleepTimer();
+    if (timer != nullptr) gTimer.store(timer, std::memory_order_release);
+    if (timer == nullptr || static_cast<iKPusLinuxTimer*>(timer)->Initialize(TickServiceRoutine) != 0) {
+        std::puts(kInitFailed);
+        DeleteLogEngine();
+        return 0;  // the timer (no thread) stays for the stop
+    }
+
+    tKPusTimingEngine* engine = new tKPusTimingEngine();
+    if (engine == nullptr) {
+        std::puts(kInitFailed);
+        DeleteLogEngine();
+        DeleteTimer();
+        return 0;
+    }
+    engine->serviceMode.store(0, kRelaxed);  // waits go through the tick service
+    gEngine.store(engine, std::memory_order_release);
+
+    gCpuSpeed.store(static_cast<iKPusLinuxTimer*>(timer)->GetTicksPerMicrosecond(), kRelaxed);
+
+    if (PalInitialize() == 0) return 0;
+
+    if (EventSystemStart() == 0) return 1;
+
+    std::puts(kInitFailed);
+    DeleteLogEngine();
+    DeleteTimer();
+    return 0;  // the engine, the pool and its semaphores stay for the stop
+}
+
+uint32_t EventSystemStart() {
+    gGlobalCallbackTime.Store(kNeverTime64);
+    gNextDeadline.Store(kNeverTime64);
+    gNextTick.Store(kNeverTime64);
+    gMonotonicCallbackTime.Store(kNeverTime64);
+    gTickPeriod.Store(kTickPeriodClocks);
+
+    void* memory = PalMemAllocZeroed(kWaitNodeCount * sizeof(WaitNode));
+    if (memory == nullptr) return 1;
+    WaitNode* pool = static_cast<WaitNode*>(memory);
+    for (uint32_t i = 0; i < kWaitNodeCount; ++i) new (&pool[i]) WaitNode();
+    InitWaitNodePool(pool, kWaitNodeCount);  // linked, autoRelease 1, not-queued mark
+    for (uint32_t i = 0; i < kWaitNodeCount; ++i) {
+        PalSemaphore* semaphore = nullptr;
+        PalSemaphoreCreate(&semaphore);
+        if (semaphore == nullptr) return 1;  // the nodes before keep theirs
+        PalSemaphoreWait(semaphore, 0);
+        pool[i].ownSemaphore.store(semaphore, kRelaxed);
+    }
+    gEventSystemReady.store(1, std::memory_order_release);
+
+    // First tick, one period from now; from here the timer thread ticks.
+    tKPusTimingEngine* engine = gEngine.load(std::memory_order_acquire);
+    ClockTime now;
+    static_cast<iKPusTimingEngine*>(engine)->ReadMonotonic5(now);
+    {
+        SchedLockGuard lock;
+        const uint64_t first = ToU64(now) + gTickPeriod.Load();
+        gNextTick.Store(first);
+        gNextDeadline.Store(first);
+        ArmTimer(FromU64(first));
+    }
+
+    engine->SetEpochOffset(ComputeEpochOffset());
+    return 0;
+}
+
+void EventSystemStop() {
+    gEventSystemReady.store(0, std::memory_order_release);
+    WaitNode* pool = gWaitNodePool.load(std::memory_order_acquire);
+    if (pool != nullptr) {
+        // Release anyone still blocked on a node's own semaphore, and let them
+        // leave before the semaphores and the pool go away.
+        for (uint32_t i = 0; i < kWaitNodeCount; ++i) {
+            PalSemaphore* s = pool[i].ownSemaphore.load(kRelaxed);
+            if (s != nullptr) PalSemaphorePost(s);
+        }
+        if (WaitForNodeWaitersToLeave()) {
+            for (uint32_t i = 0; i < kWaitNodeCount; ++i) {
+                PalSemaphore* s = pool[i].ownSemaphore.exchange(nullptr, kRelaxed);
+                if (s != nullptr) PalSemaphoreDestroy(s);
+            }
+            PalMemFree(pool);
+        } else {
+            // Destroying a semaphore under a blocked thread, or freeing a node
+            // it still reads, would be undefined; leave both allocated.
+            PAL_DEBUG_PRINT("%d waiter(s) still inside the library at stop; "
+                            "wait nodes left allocated",
+                            static_cast<int>(gActiveNodeWaiters.load()));
+        }
+        SchedLockGuard lock;
+        gWaitNodePool.store(nullptr, kRelaxed);
+        gFreeList.store(nullptr, kRelaxed);
+        gWaitList.store(nullptr, kRelaxed);
+    }
+    iKPusTimingEngine* engine = gEngine.exchange(nullptr, std::memory_order_acq_rel);
+    delete engine;
+}
+
+}  // namespace quelta
+
+using namespace quelta;
+
+extern "C" QUELTA_EXPORT iKPusTimingEngine* GetEngine__MERIDOX(void) {
+    return gEngine.load(std::memory_order_acquire);
+}
+
+extern "C" QUELTA_EXPORT iKPLogEngine* GetLogEngine__MERIDOX(void) {
+    return gLogEngine.load(std::memory_order_acquire);
+}

@@ -1,0 +1,343 @@
+// Wait nodes, the free list and the wait list (design notes in WaitList.h).
+#include "engine/WaitList.h"
+
+#include <sched.h>
+#include <time.h>
+
+#include "engine/ClockTimeOps.h"
+#include "engine/LibraryFrame.h"
+#include "engine/SchedulerState.h"
+#include "engine/TimerArming.h"
+#include "engine/tKPusTimingEngine.h"
+#include "nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.h"
+#include "tLinux/PalSemaphoreOps.h"
+#include "tLinux/PalThreads.h"
+
+namespace quelta {
+
+namespace {
+
+std::atomic<bool> gSchedLockReady{false};
+
+constexpr std::memory_order kRelaxed = std::memory_order_relaxed;
+
+// Unlinks a queued node from the wait list. Lock held. The node's own links
+// keep their values; nothing else refers to it afterwards.
+void UnlinkQueued(WaitNode* node) {
+    WaitNode* next = node->next.load(kRelaxed);
+    WaitNode* prev = node->prev.load(kRelaxed);
+    if (gWaitList.load(kRelaxed) == node) {
+        gWaitList.store(next, std::memory_order_release);
+        if (next != nullptr) next->prev.store(nullptr, kRelaxed);
+    } else if (prev != nullptr) {
+        prev->next.store(next, std::memory_order_release);
+        if (next != nullptr) next->prev.store(prev, kRelaxed);
+    }
+}
+
+// Pushes a node on the free list. Lock held.
+void PushFree(WaitNode* node) {
+    node->next.store(gFreeList.load(kRelaxed), kRelaxed);
+    node->state.store(static_cast<uint32_t>(NodeState::kFree), kRelaxed);
+    gFreeList.store(node, kRelaxed);
+}
+
+// Links `node` into the wait list in deadline order, behind every node whose
+// effective deadline is not later than its own. Lock held.
+void LinkSorted(WaitNode* node) {
+    WaitNode* head = gWaitList.load(kRelaxed);
+    if (head == nullptr) {
+        node->next.store(nullptr, kRelaxed);
+        gWaitList.store(node, std::memory_order_release);
+    } else if (Earlier(EffectiveDeadline(node), EffectiveDeadline(head))) {
+        node->next.store(head, kRelaxed);
+        head->prev.store(node, kRelaxed);
+        gWaitList.store(node, std::memory_order_release);
+    } else {
+        WaitNode* current = head;
+        for (;;) {
+            WaitNode* following = current->next.load(kRelaxed);
+            if (following == nullptr) {
+                node->prev.store(current, kRelaxed);
+                node->next.store(nullptr, kRelaxed);
+                current->next.store(node, std::memory_order_release);
+                break;
+            }
+            if (Earlier(EffectiveDeadline(node), EffectiveDeadline(following))) {
+                node->prev.store(current, kRelaxed);
+                node->next.store(following, kRelaxed);
+                following->prev.store(node, kRelaxed);
+                current->next.store(node, std::memory_order_release);
+                break;
+            }
+            current = following;
+        }
+    }
+    gWaitListVersion.fetch_add(1, kRelaxed);
+    node->state.store(static_cast<uint32_t>(NodeState::kQueued), kRelaxed);
+}
+
+bool OnTimerThread() {
+    tKPusLinuxNanoSleepTimer* timer = gTimer.load(std::memory_order_acquire);
+    return timer != nullptr && timer->state.threadId.load(kRelaxed) == PalGetThreadId();
+}
+
+// Waits a moment for the tick service to finish firing a node.
+void PauseForFiring(uint32_t round) {
+    if (round < 64) {
+        sched_yield();
+    } else {
+        timespec ts{0, 20000};  // 20 us
+        nanosleep(&ts, nullptr);
+    }
+}
+
+}  // namespace
+
+pthread_mutex_t gSchedLock;
+
+void InitSchedLock() {
+    if (gSchedLockReady.load(std::memory_order_acquire)) return;
+    pthread_mutexattr_t attr;
+    pthread_mutexattr_init(&attr);
+    // Priority inheritance: a caller holding the lock while the timer thread
+    // waits for it runs at the timer thread's priority until it lets go.
+    pthread_mutexattr_setprotocol(&attr, PTHREAD_PRIO_INHERIT);
+    pthread_mutex_init(&gSchedLock, &attr);
+    pthread_mutexattr_destroy(&attr);
+    gSchedLockReady.store(true, std::memory_order_release);
+}
+
+SchedLockGuard::SchedLockGuard() { pthread_mutex_lock(&gSchedLock); }
+SchedLockGuard::~SchedLockGuard() { pthread_mutex_unlock(&gSchedLock); }
+
+uint64_t EffectiveDeadline(const WaitNode* node) {
+    uint64_t deadline = node->deadline.load(kRelaxed);
+    if (node->isGlobal.load(kRelaxed) == 0) return deadline;
+    tKPusTimingEngine* engine = gEngine.load(std::memory_order_acquire);
+    if (engine == nullptr) return deadline;
+    iKPusTimingEngine* e = engine;
+    return ToU64(e->GlobalToMonotonicFwd(FromU64(deadline)));
+}
+
+void InitWaitNodePool(WaitNode* pool, uint32_t count) {
+    InitSchedLock();
+    for (uint32_t i = 0; i < count; ++i) {
+        WaitNode& n = pool[i];
+        n.semaphore.store(nullptr, kRelaxed);
+        n.deadline.store(0, kRelaxed);
+        n.callback.store(nullptr, kRelaxed);
+        n.callbackArg.store(nullptr, kRelaxed);
+        n.fireCount.store(0, kRelaxed);
+        n.isGlobal.store(0, kRelaxed);
+        n.next.store(i + 1 < count ? &pool[i + 1] : nullptr, kRelaxed);
+        n.prev.store(NotQueuedMark(), kRelaxed);
+        n.autoRelease.store(1, kRelaxed);
+        n.abortable.store(0, kRelaxed);
+        n.state.store(static_cast<uint32_t>(NodeState::kFree), kRelaxed);
+        n.releasePending.store(0, kRelaxed);
+    }
+    SchedLockGuard lock;
+    gWaitNodePool.store(pool, kRelaxed);
+    gWaitList.store(nullptr, kRelaxed);
+    gFreeList.store(count ? pool : nullptr, kRelaxed);
+}
+
+bool IsPoolNode(const WaitNode* node) {
+    const WaitNode* pool = gWaitNodePool.load(kRelaxed);
+    if (pool == nullptr || node == nullptr) return false;
+    uintptr_t p = reinterpret_cast<uintptr_t>(node);
+    uintptr_t base = reinterpret_cast<uintptr_t>(pool);
+    if (p < base || p >= base + kWaitNodeCount * sizeof(WaitNode)) return false;
+    return (p - base) % sizeof(WaitNode) == 0;
+}
+
+WaitNode* TakeFreeNode() {
+    if (gEventSystemReady.load(kRelaxed) == 0) return nullptr;
+    SchedLockGuard lock;
+    WaitNode* node = gFreeList.load(kRelaxed);
+    if (node == nullptr) return nullptr;
+    gFreeList.store(node->next.load(kRelaxed), kRelaxed);
+    node->state.store(static_cast<uint32_t>(NodeState::kHeld), kRelaxed);
+    node->releasePending.store(0, kRelaxed);
+    return node;
+}
+
+uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
+                        QueltaWaitCallbackFn callback, void* callbackArg) {
+    node->callbackArg.store(callbackArg, kRelaxed);
+    node->callback.store(callback, kRelaxed);
+    node->deadline.store(ToU64(*deadline), kRelaxed);
+
+    bool queued = false;
+    {
+        SchedLockGuard lock;
+        // Without a serving timer nothing would ever fire the node: refuse it
+        // whatever its deadline instead of letting its waiter hang.
+        if (TimerServing()) {
+            LinkSorted(node);
+            queued = true;
+            if (gWaitList.load(kRelaxed) == node) {
+                uint64_t effective = EffectiveDeadline(node);
+                if (Earlier(effective, gNextDeadline.Load())) {
+                    gNextDeadline.Store(effective);
+                    if (ArmTimer(FromU64(effective)) == 0) {
+                        queued = false;
+                        UnlinkQueued(node);
+                        node->state.store(static_cast<uint32_t>(NodeState::kHeld), kRelaxed);
+                    }
+                }
+            }
+        }
+        if (!queued && node->autoRelease.load(kRelaxed) != 0) PushFree(node);
+    }
+    return queued ? 0 : 1;
+}
+
+void ReleaseWaitNode(WaitNode* node) {
+    if (gEventSystemReady.load(kRelaxed) == 0 || node == nullptr) return;
+    if (!IsPoolNode(node)) {
+        PAL_DEBUG_PRINT("ReleaseWaitNode: %p is not a wait node of this library; ignored",
+                        static_cast<void*>(node));
+        return;
+    }
+    if (node->prev.load(kRelaxed) == NotQueuedMark()) return;  // never taken
+    for (uint32_t round = 0;; ++round) {
+        {
+            SchedLockGuard lock;
+            NodeState state = static_cast<NodeState>(node->state.load(kRelaxed));
+            if (state == NodeState::kFree) {
+                PAL_DEBUG_PRINT("ReleaseWaitNode: node %p released twice; ignored",
+                                static_cast<void*>(node));
+                return;
+            }
+            if (state == NodeState::kQueued) {  // cancels the wait
+                UnlinkQueued(node);
+                PushFree(node);
+                return;
+            }
+            if (state == NodeState::kHeld || state == NodeState::kFired) {
+                PushFree(node);  // a fired node is off the list already
+                return;
+            }
+            // kFiring. From a callback on the timer thread the firing cannot
+            // finish while we wait: let it free the node when it settles.
+            if (OnTimerThread()) {
+                node->releasePending.store(1, kRelaxed);
+                return;
+            }
+        }
+        PauseForFiring(round);
+    }
+}
+
+// Under the lock: the node leaves the wait list and is marked as firing.
+static void DetachForFiring(WaitNode* node) {
+    gWaitListVersion.fetch_add(1, kRelaxed);
+    node->fireCount.fetch_add(1, std::memory_order_release);
+    UnlinkQueued(node);
+    node->releasePending.store(0, kRelaxed);
+    node->state.store(static_cast<uint32_t>(NodeState::kFiring), kRelaxed);
+}
+
+// Without the lock: post, callback, then settle where the node goes.
+static void FinishFiring(WaitNode* node) {
+    PalSemaphore* semaphore = node->semaphore.load(kRelaxed);
+    if (semaphore != nullptr) PalSemaphorePost(semaphore);
+    uint32_t release = node->autoRelease.load(kRelaxed);
+    QueltaWaitCallbackFn callback = node->callback.load(kRelaxed);
+    if (callback != nullptr) {
+        release = callback(node->callbackArg.load(kRelaxed));
+        node->autoRelease.store(release, kRelaxed);
+    }
+    SchedLockGuard lock;
+    if (release != 0 || node->releasePending.load(kRelaxed) != 0) {
+        PushFree(node);
+    } else {
+        node->state.store(static_cast<uint32_t>(NodeState::kFired), kRelaxed);
+    }
+}
+
+void FireWaitNode(WaitNode* node) {
+    {
+        SchedLockGuard lock;
+        if (node->state.load(kRelaxed) != static_cast<uint32_t>(NodeState::kQueued)) return;
+        DetachForFiring(node);
+    }
+    FinishFiring(node);
+}
+
+bool FireHeadIfDue(uint64_t now) {
+    WaitNode* head;
+    {
+        SchedLockGuard lock;
+        head = gWaitList.load(kRelaxed);
+        if (head == nullptr) return false;
+        if (!Due(EffectiveDeadline(head), now)) {
+            // The head stays queued: fold its deadline into the next arming.
+            uint64_t effective = EffectiveDeadline(head);
+            if (Earlier(effective, gNextDeadline.Load())) {
+                gNextDeadline.Store(EffectiveDeadline(head));
+            }
+            return false;
+        }
+        DetachForFiring(head);
+    }
+    FinishFiring(head);
+    return true;
+}
+
+void FireAbortableGlobalNodes() {
+    WaitNode* batch[kWaitNodeCount];
+    uint32_t n = 0;
+    {
+        SchedLockGuard lock;
+        WaitNode* node = gWaitList.load(kRelaxed);
+        while (node != nullptr && n < kWaitNodeCount) {
+            WaitNode* next = node->next.load(kRelaxed);
+            if (node->isGlobal.load(kRelaxed) != 0 && node->abortable.load(kRelaxed) != 0) {
+                DetachForFiring(node);
+                batch[n++] = node;
+            }
+            node = next;
+        }
+    }
+    for (uint32_t i = 0; i < n; ++i) FinishFiring(batch[i]);
+}
+
+bool AuditWaitNodes(uint32_t* freeCount, uint32_t* queuedCount, uint32_t* heldCount) {
+    SchedLockGuard lock;
+    WaitNode* pool = gWaitNodePool.load(kRelaxed);
+    if (pool == nullptr) return false;
+    uint8_t seen[kWaitNodeCount] = {};
+    bool ok = true;
+    uint32_t nFree = 0, nQueued = 0, nHeld = 0;
+    for (WaitNode* n = gFreeList.load(kRelaxed); n != nullptr; n = n->next.load(kRelaxed)) {
+        if (!IsPoolNode(n) || seen[n - pool]++ || nFree > kWaitNodeCount) return false;
+        ok = ok && n->state.load(kRelaxed) == static_cast<uint32_t>(NodeState::kFree);
+        ++nFree;
+    }
+    WaitNode* prev = nullptr;
+    for (WaitNode* n = gWaitList.load(kRelaxed); n != nullptr; n = n->next.load(kRelaxed)) {
+        if (!IsPoolNode(n) || seen[n - pool]++ || nQueued > kWaitNodeCount) return false;
+        ok = ok && n->state.load(kRelaxed) == static_cast<uint32_t>(NodeState::kQueued);
+        ok = ok && n->prev.load(kRelaxed) == prev;
+        prev = n;
+        ++nQueued;
+    }
+    for (uint32_t i = 0; i < kWaitNodeCount; ++i) {
+        if (seen[i]) continue;
+        uint32_t s = pool[i].state.load(kRelaxed);
+        // Not on a list: must be held by a caller (taken, or fired and unlinked).
+        ok = ok && (s == static_cast<uint32_t>(NodeState::kHeld) ||
+                    s == static_cast<uint32_t>(NodeState::kFired) ||
+                    s == static_cast<uint32_t>(NodeState::kFiring));
+        ++nHeld;
+    }
+    if (freeCount) *freeCount = nFree;
+    if (queuedCount) *queuedCount = nQueued;
+    if (heldCount) *heldCount = nHeld;
+    return ok;
+}
+
+}  // namespace quelta
