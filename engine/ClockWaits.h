@@ -10,6 +10,10 @@ namespace quelta {
 void SleepUntilClocks(ClockTime deadline);  // absolute
 void SleepClocks(ClockTime duration);       // relative, resumes the remainder
 
+// Engine slot 49: sleeps until the next multiple of a 64-bit period and
+// returns the monotonic time read after the wait.
+ClockTime WaitUntilNextMultipleClocks64Impl(const ClockTime& period);
+
 }  // namespace quelta
 
 #endif

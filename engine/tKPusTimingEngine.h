@@ -105,6 +105,7 @@ public:
     uint32_t Calibrate();
     // As Calibrate, but gives up after `timeoutMs` without the tick service
     // advancing and returns 0; for tools and tests that must never hang.
+    // A timeout of 0 waits without limit, like Calibrate.
     uint32_t CalibrateWithin(uint32_t timeoutMs);
 
     static void* operator new(size_t bytes) noexcept;

@@ -3,9 +3,12 @@
 // Ends a registered thread's current clock_nanosleep promptly, including when
 // the wake lands just before the thread enters its sleep. A sleeper registers
 // a PalWakeSlot, sleeps with PalWakeableSleepUntil, and the waker calls
-// PalWakeThread. The wake is carried by a request flag plus SIGALRM; the
+// PalWakeThreadId. The wake is carried by a request flag plus SIGALRM; the
 // signal handler zeroes the sleeper's pending request so that a wake landing
 // between the sleeper's last check and its system call still ends the sleep.
+// The process's SIGALRM handler must call PalWakeOnSignal (the timer's does).
+// A waker may only name a thread that stays registered until the wake is
+// sent (the timer guarantees it: its thread unregisters only when it ends).
 #ifndef QUELTA_TLINUX_PALWAKE_H
 #define QUELTA_TLINUX_PALWAKE_H
 
@@ -33,6 +36,8 @@ void PalWakeUnregister(PalWakeSlot* slot);
 
 // Sleeps on CLOCK_MONOTONIC until the absolute deadline; EINTR without a wake
 // request resumes the same sleep. A pending wake request returns kWoken at once.
+// kDeadline is returned only once the clock has reached the deadline, never
+// for a request zeroed by the handler. A null slot sleeps unwakeably.
 PalSleepResult PalWakeableSleepUntil(PalWakeSlot* slot, const timespec& deadline);
 
 // Clears a pending wake request (the sleeper calls it when it takes new work).
@@ -49,6 +54,11 @@ void PalWakeOnSignal();
 
 // Seam: tests switch the stand-in off to exercise the plain SIGALRM fallback.
 extern std::atomic<bool> gPalWakeStandInEnabled;
+
+// Seam: when set, called on the sleeping thread after its last look at the
+// wake request and right before clock_nanosleep, so that tests can land a
+// wake in that window deterministically. Null in the product.
+extern std::atomic<void (*)()> gPalWakeWindowHook;
 
 }  // namespace quelta
 

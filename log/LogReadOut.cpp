@@ -1,0 +1,134 @@
+// The log engine's read-out: the newest entries of all CPUs, merged in time
+// order.
+//
+// The bank being written is frozen by pointing the recorders at the other
+// bank; its rings are then read from their newest entry backwards, and each
+// output entry is the latest of the rings' current heads, so the caller's
+// arrays fill from the top down and end up in ascending time order. Nothing
+// is locked: a recorder that chose its ring before the switch may still be
+// writing while we read, so entries can be torn or missed, but every index
+// read from a shared word is checked against the ring it is used on.
+#include <cstring>
+
+#include "engine/ClockTimeOps.h"
+#include "log/tKPLogEngine.h"
+
+namespace quelta {
+
+namespace {
+
+constexpr std::memory_order kRelaxed = std::memory_order_relaxed;
+
+// Moves `copied` words from index `from` down to index 0 (regions may overlap).
+void MoveDown(uint32_t* array, uint32_t from, uint32_t copied) {
+    if (array != nullptr) std::memmove(array, array + from, copied * sizeof(uint32_t));
+}
+
+}  // namespace
+
+void tKPLogEngine::ReadOut7(uint32_t& count, uint32_t timeLow[], uint32_t timeHigh[],
+                            uint32_t events[], uint32_t last) {
+    ReadOutMerged(count, timeLow, timeHigh, events, nullptr, last);
+}
+
+// `last` is part of the runtime's call but carries nothing the read-out uses.
+void tKPLogEngine::ReadOutMerged(uint32_t& count, uint32_t timeLow[], uint32_t timeHigh[],
+                                 uint32_t events[], uint32_t data[], uint32_t /*last*/) {
+    const uint32_t n = cpuCount;
+
+    // Empty the other bank and send the recorders there; the bank they were
+    // writing is now frozen for reading.
+    const uint32_t frozen = activeBank.load(kRelaxed) != 0 ? n : 0;
+    const uint32_t other = frozen == 0 ? n : 0;
+    for (uint32_t i = 0; i < n; ++i) {
+        records[other + i].writeIndex.store(0, kRelaxed);
+        records[other + i].wrapCount.store(0, kRelaxed);
+    }
+    activeBank.store(other, kRelaxed);
+
+    // Cursors: each ring is read from its newest entry towards older ones. A
+    // write index beyond the ring (a recorder racing a Configure) is treated
+    // as a full ring.
+    uint64_t total = 0;
+    for (uint32_t i = 0; i < n; ++i) {
+        LogCpuRecord& record = records[frozen + i];
+        const LogRing ring = LoadRing(record);
+        const uint32_t written = record.writeIndex.load(kRelaxed);
+        uint32_t remaining = record.wrapCount.load(kRelaxed) != 0 ? ring.capacity : written;
+        if (remaining > ring.capacity) remaining = ring.capacity;
+        uint32_t pos = written - 1;
+        if (pos >= ring.capacity) pos = ring.capacity - 1;  // 0 on an empty ring
+        record.readPos.store(pos, kRelaxed);
+        record.readRemaining.store(remaining, kRelaxed);
+        total += remaining;
+    }
+
+    if (count > total) count = static_cast<uint32_t>(total);
+    const uint32_t m = count;
+    // Nothing to copy: the recorders stay on the emptied bank, so the log
+    // starts afresh from here (the next read-out empties the frozen bank).
+    if (m == 0) return;
+
+    uint32_t k = m;
+    while (k > 0) {
+        // The latest head; ties go to the lower CPU index, which is seen
+        // first and only replaced by a strictly later time. The search starts
+        // from time 0, so a head stamped 0 (or with high word 0xFFFFFFFF, which
+        // orders before 0) is never chosen.
+        uint64_t bestTime = 0;
+        uint32_t best = n;
+        uint32_t bestEvent = 0;
+        uint32_t bestData = 0;
+        uint32_t bestPos = 0;
+        uint32_t bestCapacity = 0;
+        for (uint32_t i = 0; i < n; ++i) {
+            LogCpuRecord& record = records[frozen + i];
+            if (record.readRemaining.load(kRelaxed) == 0) continue;
+            const LogRing ring = LoadRing(record);
+            if (ring.capacity == 0) continue;
+            uint32_t pos = record.readPos.load(kRelaxed);
+            if (pos >= ring.capacity) pos = ring.capacity - 1;
+            const LogEntry& entry = ring.entries[pos];
+            const uint64_t time = (static_cast<uint64_t>(entry.timeHigh.load(kRelaxed)) << 32) |
+                                  entry.timeLow.load(kRelaxed);
+            if (!Earlier(bestTime, time)) continue;
+            bestTime = time;
+            best = i;
+            bestEvent = entry.event.load(kRelaxed);
+            bestData = entry.data.load(kRelaxed);
+            bestPos = pos;
+            bestCapacity = ring.capacity;
+        }
+        // Every remaining head carries a time that is never chosen: stop
+        // here rather than hand out an entry that is not the latest.
+        if (best == n) break;
+
+        --k;
+        timeLow[k] = static_cast<uint32_t>(bestTime);
+        timeHigh[k] = static_cast<uint32_t>(bestTime >> 32);
+        // Bits 8-15 name the CPU; only its low 8 bits fit there.
+        events[k] = (bestEvent & ~0xFF00u) | ((best & 0xFFu) << 8);
+        if (data != nullptr) data[k] = bestData;
+
+        LogCpuRecord& chosen = records[frozen + best];
+        chosen.readPos.store(bestPos == 0 ? bestCapacity - 1 : bestPos - 1, kRelaxed);
+        const uint32_t remaining = chosen.readRemaining.load(kRelaxed);
+        chosen.readRemaining.store(remaining != 0 ? remaining - 1 : 0, kRelaxed);
+    }
+
+    // A stopped merge filled only indices k..m-1. Move them down so that the
+    // caller's arrays always hold `count` entries at 0..count-1, oldest first.
+    if (k > 0) {
+        const uint32_t copied = m - k;
+        MoveDown(timeLow, k, copied);
+        MoveDown(timeHigh, k, copied);
+        MoveDown(events, k, copied);
+        MoveDown(data, k, copied);
+        count = copied;
+    }
+
+    // Recording resumes in the bank it was writing, untouched by the read.
+    activeBank.store(frozen, kRelaxed);
+}
+
+}  // namespace quelta

@@ -1,0 +1,320 @@
+// The tick scheduler driven deterministically: tick passes at chosen times,
+// a fake timer that records its arming, callbacks that record their calls.
+#include <gtest/gtest.h>
+
+#include <vector>
+
+#include "SchedulerHarness.h"
+#include "engine/LibraryFrame.h"
+#include "engine/SchedulerState.h"
+#include "engine/TickService.h"
+#include "engine/tKPusTimingEngine.h"
+#include "engine/WaitList.h"
+#include "quelta/quelta.h"
+
+using namespace quelta;
+using testsupport::SchedulerHarness;
+
+namespace {
+
+constexpr uint64_t kMs = 1000000;
+
+std::vector<uint64_t> gTicks;
+void RecordTick(uint64_t serial) { gTicks.push_back(serial); }
+
+struct CallbackCall {
+    void* arg;
+    uint64_t nowSeen;  // the ClockTime behind arg when arg is the pass's now
+};
+std::vector<CallbackCall> gCalls;
+void RecordCallback(void* arg) {
+    gCalls.push_back({arg, ToU64(*static_cast<ClockTime*>(arg))});
+}
+
+std::vector<int> gFired;
+uint32_t gReleaseDecision = 0;
+uint32_t RecordFire(void* arg) {
+    gFired.push_back(static_cast<int>(reinterpret_cast<intptr_t>(arg)));
+    return gReleaseDecision;
+}
+
+class SchedulerTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        gTicks.clear();
+        gCalls.clear();
+        gFired.clear();
+        gReleaseDecision = 0;
+    }
+    uint32_t Queue(WaitNode* node, uint64_t deadline, int tag, QueltaWaitCallbackFn cb = RecordFire) {
+        ClockTime d = FromU64(deadline);
+        return InsertWaitNode(node, &d, cb, reinterpret_cast<void*>(static_cast<intptr_t>(tag)));
+    }
+    std::vector<WaitNode*> ListOrder() {
+        std::vector<WaitNode*> out;
+        for (WaitNode* n = gWaitList.load(); n != nullptr; n = n->next.load()) out.push_back(n);
+        return out;
+    }
+    SchedulerHarness h;
+};
+
+TEST_F(SchedulerTest, TickAtItsTimeHasZeroJitterAndKeepsTheGrid) {
+    auto* engine = gEngine.load();
+    engine->statsCount.store(0);
+    engine->statsEnabled.store(1);
+    h.SetNow(gNextTick.Load());
+    h.Pass();
+    EXPECT_EQ(engine->statsCount.load(), 1);
+    EXPECT_EQ(engine->stats.jitterSamples[0].load(), 0u);
+    EXPECT_EQ(gNextTick.Load(), h.Now() + kMs);
+    EXPECT_EQ(h.timer->LastArmed(), h.Now() + kMs);
+}
+
+TEST_F(SchedulerTest, LatePassServesOneTickThenRestartsTheGrid) {
+    gTickCallback.store(RecordTick);
+    const uint64_t late = gNextTick.Load() + 3 * kMs + kMs / 2;  // 3.5 periods late
+    h.SetNow(late);
+    h.Pass();
+    EXPECT_EQ(gNextTick.Load(), late);        // missed ticks are not replayed
+    EXPECT_EQ(h.timer->LastArmed(), late);    // next tick due at once
+    h.SetNow(late + 1000);
+    h.Pass();
+    EXPECT_EQ(gNextTick.Load(), late + kMs);  // one period past the served tick
+    EXPECT_EQ(gTicks, (std::vector<uint64_t>{0, 1}));  // two calls, not four
+}
+
+TEST_F(SchedulerTest, TickSerialCountsOnlyWhileRegistered) {
+    for (int i = 0; i < 500; ++i) {
+        h.SetNow(gNextTick.Load());
+        h.Pass();
+    }
+    gTickCallback.store(RecordTick);
+    h.SetNow(gNextTick.Load());
+    h.Pass();
+    h.SetNow(h.Now() + kMs / 2);  // no tick due on this pass
+    h.Pass();
+    EXPECT_EQ(gTicks, (std::vector<uint64_t>{0}));
+}
+
+TEST_F(SchedulerTest, BothCallbackTimesDueInOnePassCallTwiceMonotonicFirst) {
+    quelta_iTSC_SetCallback(RecordCallback, nullptr);
+    ClockTime t = FromU64(h.Now() + 100);
+    ASSERT_EQ(quelta_iTSC_SetCallbackTime(&t, 0), 1u);
+    ASSERT_EQ(quelta_iTSC_SetCallbackTime(&t, -1), 1u);  // global == monotonic here
+    EXPECT_EQ(h.timer->LastArmed(), ToU64(t));           // earlier than the tick: armed
+    h.SetNow(h.Now() + 200);
+    h.Pass();
+    ASSERT_EQ(gCalls.size(), 2u);
+    // With no argument set, the callback receives the pass's own `now`.
+    EXPECT_EQ(gCalls[0].nowSeen, h.Now());
+    EXPECT_EQ(gCalls[1].nowSeen, h.Now());
+    EXPECT_TRUE(IsNever(gMonotonicCallbackTime.Load()));
+    EXPECT_TRUE(IsNever(gGlobalCallbackTime.Load()));
+}
+
+TEST_F(SchedulerTest, CallbackTimeLaterThanTheTickIsFoldedAndArmedExactly) {
+    quelta_iTSC_SetCallback(RecordCallback, nullptr);
+    const uint64_t when = h.Now() + 5 * kMs + 300000;  // between ticks, 5 ms ahead
+    ClockTime t = FromU64(when);
+    const size_t armedBefore = h.timer->armed.size();
+    ASSERT_EQ(quelta_iTSC_SetCallbackTime(&t, 0), 1u);
+    EXPECT_EQ(h.timer->armed.size(), armedBefore);  // stored without arming
+    // Ticks until the pass before it: that pass arms for the callback time itself.
+    while (gNextTick.Load() + kMs <= when) {
+        h.SetNow(gNextTick.Load());
+        h.Pass();
+    }
+    h.SetNow(gNextTick.Load());
+    h.Pass();
+    EXPECT_EQ(h.timer->LastArmed(), when);
+    EXPECT_TRUE(gCalls.empty());
+    h.SetNow(when);
+    h.Pass();
+    EXPECT_EQ(gCalls.size(), 1u);
+}
+
+void ReArmingCallback(void* arg) {
+    gCalls.push_back({arg, 0});
+    if (gCalls.size() < 3) {
+        ClockTime next = FromU64(ToU64(*static_cast<ClockTime*>(arg)) + 250000);
+        quelta_iTSC_SetCallbackTime(&next, 0);
+    }
+}
+
+TEST_F(SchedulerTest, CallbackSettingItsNextTimeIsArmedAtOnce) {
+    quelta_iTSC_SetCallback(ReArmingCallback, nullptr);
+    ClockTime t = FromU64(h.Now() + 100000);
+    quelta_iTSC_SetCallbackTime(&t, 0);
+    h.SetNow(h.Now() + 100000);
+    h.Pass();
+    EXPECT_EQ(gCalls.size(), 1u);
+    EXPECT_EQ(ToU64(gMonotonicCallbackTime.LoadTime()), h.Now() + 250000);
+    EXPECT_EQ(h.timer->LastArmed(), h.Now() + 250000);  // the pass kept the earlier time
+    h.SetNow(h.Now() + 250000);
+    h.Pass();
+    EXPECT_EQ(gCalls.size(), 2u);
+}
+
+TEST_F(SchedulerTest, CallbackArgumentAndNeverTimeCancel) {
+    int token = 0;
+    quelta_iTSC_SetCallback(RecordCallback, &token);
+    ClockTime t = FromU64(h.Now() + 10);
+    quelta_iTSC_SetCallbackTime(&t, 0);
+    ClockTime never = kNeverTime;
+    EXPECT_EQ(quelta_iTSC_SetCallbackTime(&never, 0), 1u);  // cancels
+    h.SetNow(h.Now() + 100);
+    h.Pass();
+    EXPECT_TRUE(gCalls.empty());
+    quelta_iTSC_SetCallbackTime(&t, 0);
+    h.Pass();
+    ASSERT_EQ(gCalls.size(), 1u);
+    EXPECT_EQ(gCalls[0].arg, &token);
+}
+
+TEST_F(SchedulerTest, CallbackTimeWithoutTimerIsRefusedOnlyWhenItWouldArm) {
+    h.RemoveTimer();
+    const uint64_t deadlineBefore = gNextDeadline.Load();
+    ClockTime early = FromU64(h.Now() + 10);
+    EXPECT_EQ(quelta_iTSC_SetCallbackTime(&early, 0), 0u);
+    EXPECT_TRUE(IsNever(gMonotonicCallbackTime.Load()));
+    EXPECT_EQ(gNextDeadline.Load(), deadlineBefore);
+    ClockTime late = FromU64(h.Now() + 50 * kMs);
+    EXPECT_EQ(quelta_iTSC_SetCallbackTime(&late, 0), 1u);
+    EXPECT_EQ(gMonotonicCallbackTime.Load(), ToU64(late));
+}
+
+TEST_F(SchedulerTest, ExpiredNodesFireInListOrderAndTheNextIsFolded) {
+    const uint64_t now = h.Now();
+    WaitNode* a = h.Take();
+    WaitNode* b = h.Take();
+    WaitNode* c = h.Take();
+    WaitNode* d = h.Take();
+    ASSERT_EQ(Queue(c, now + 300, 3), 0u);
+    ASSERT_EQ(Queue(a, now + 100, 1), 0u);
+    ASSERT_EQ(Queue(b, now + 300, 2), 0u);  // same deadline as c, queued after it
+    ASSERT_EQ(Queue(d, now + 600000, 4), 0u);
+    EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{a, c, b, d}));
+    h.SetNow(now + 500);
+    h.Pass();
+    EXPECT_EQ(gFired, (std::vector<int>{1, 3, 2}));
+    EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{d}));
+    EXPECT_EQ(h.timer->LastArmed(), now + 600000);  // earlier than the next tick
+    for (WaitNode* n : {a, b, c}) {
+        EXPECT_EQ(n->fireCount.load(), 1u);
+        EXPECT_EQ(n->state.load(), static_cast<uint32_t>(NodeState::kFired));
+        ReleaseWaitNode(n);
+    }
+    ReleaseWaitNode(d);  // cancels the queued wait
+    uint32_t freeCount = 0;
+    EXPECT_TRUE(AuditWaitNodes(&freeCount, nullptr, nullptr));
+    EXPECT_EQ(freeCount, kWaitNodeCount);
+}
+
+TEST_F(SchedulerTest, ReleaseDecisionComesFromTheCallbackOrAutoRelease) {
+    const uint64_t now = h.Now();
+    WaitNode* keep = h.Take();
+    WaitNode* back = h.Take();
+    WaitNode* plain = h.Take();
+    keep->autoRelease.store(0);
+    back->autoRelease.store(0);
+    plain->autoRelease.store(1);
+    Queue(keep, now + 1, 1);
+    gReleaseDecision = 0;
+    h.SetNow(now + 2);
+    h.Pass();
+    gReleaseDecision = 1;
+    Queue(back, now + 3, 2);
+    Queue(plain, now + 3, 3, nullptr);
+    h.SetNow(now + 4);
+    h.Pass();
+    EXPECT_EQ(keep->state.load(), static_cast<uint32_t>(NodeState::kFired));
+    EXPECT_EQ(back->state.load(), static_cast<uint32_t>(NodeState::kFree));
+    EXPECT_EQ(plain->state.load(), static_cast<uint32_t>(NodeState::kFree));
+    ReleaseWaitNode(keep);
+    uint32_t freeCount = 0, queued = 0, held = 0;
+    EXPECT_TRUE(AuditWaitNodes(&freeCount, &queued, &held));
+    EXPECT_EQ(freeCount, kWaitNodeCount);
+}
+
+TEST_F(SchedulerTest, InsertArmsOnlyForANewEarliestDeadline) {
+    const uint64_t now = h.Now();
+    const size_t armed0 = h.timer->armed.size();
+    WaitNode* late = h.Take();
+    Queue(late, now + 5 * kMs, 1);  // later than the next tick: no arming
+    EXPECT_EQ(h.timer->armed.size(), armed0);
+    WaitNode* early = h.Take();
+    Queue(early, now + 200000, 2);
+    EXPECT_EQ(h.timer->LastArmed(), now + 200000);
+    EXPECT_EQ(gNextDeadline.Load(), now + 200000);
+    WaitNode* never = h.Take();
+    ClockTime n = kNeverTime;
+    InsertWaitNode(never, &n, nullptr, nullptr);
+    WaitNode* first = h.Take();
+    Queue(first, 0xFFFFFFFF00000000ull, 3);  // high word 0xFFFFFFFF: before every time
+    EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{first, early, late, never}));
+    h.Pass();  // fires at the next pass
+    EXPECT_EQ(gFired, (std::vector<int>{3}));
+}
+
+TEST_F(SchedulerTest, InsertWithoutTimerIsRefusedAndLeavesTheListAlone) {
+    const uint64_t now = h.Now();
+    WaitNode* queued = h.Take();
+    Queue(queued, now + 500000, 1);
+    h.RemoveTimer();
+    WaitNode* held = h.Take();
+    held->autoRelease.store(0);
+    EXPECT_EQ(Queue(held, now + 100, 2), 1u);
+    EXPECT_EQ(held->state.load(), static_cast<uint32_t>(NodeState::kHeld));
+    WaitNode* autoNode = h.Take();
+    autoNode->autoRelease.store(1);
+    EXPECT_EQ(Queue(autoNode, now + 100, 3), 1u);
+    EXPECT_EQ(gFreeList.load(), autoNode);  // straight back to the pool
+    EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{queued}));
+    ReleaseWaitNode(held);
+    ReleaseWaitNode(queued);
+    uint32_t freeCount = 0;
+    EXPECT_TRUE(AuditWaitNodes(&freeCount, nullptr, nullptr));
+    EXPECT_EQ(freeCount, kWaitNodeCount);
+}
+
+TEST_F(SchedulerTest, BadReleasesAreRefusedWithoutCorruptingTheLists) {
+    WaitNode* fresh = gFreeList.load();
+    ReleaseWaitNode(fresh);  // never taken: nothing happens
+    WaitNode* n = h.Take();
+    ReleaseWaitNode(n);
+    ReleaseWaitNode(n);  // twice: refused
+    WaitNode foreign{};
+    ReleaseWaitNode(&foreign);
+    ReleaseWaitNode(reinterpret_cast<WaitNode*>(reinterpret_cast<char*>(n) + 4));
+    uint32_t freeCount = 0;
+    EXPECT_TRUE(AuditWaitNodes(&freeCount, nullptr, nullptr));
+    EXPECT_EQ(freeCount, kWaitNodeCount);
+}
+
+TEST_F(SchedulerTest, PoolExhaustionAndUnstartedSystemRefuse) {
+    std::vector<WaitNode*> taken;
+    while (WaitNode* n = h.Take()) taken.push_back(n);
+    EXPECT_EQ(taken.size(), kWaitNodeCount);
+    ClockTime d = FromU64(h.Now() + kMs);
+    EXPECT_EQ(quelta_iTSCEvent_Wait_Callback_C(nullptr, &d, RecordFire, nullptr, 0, nullptr), 3u);
+    for (WaitNode* n : taken) ReleaseWaitNode(n);
+    gEventSystemReady.store(0);
+    EXPECT_EQ(quelta_iTSCEvent_Wait_Callback_C(nullptr, &d, RecordFire, nullptr, 0, nullptr), 3u);
+    gEventSystemReady.store(1);
+}
+
+TEST_F(SchedulerTest, TickCallbackRegistrationAndControlFlag) {
+    iKPusTimingEngine* e = gEngine.load();
+    e->RegisterTickCallback(RecordTick);
+    EXPECT_EQ(gTickCallback.load(), &RecordTick);
+    e->UnregisterTickCallback(nullptr);  // wrong function: cleared all the same
+    EXPECT_EQ(gTickCallback.load(), nullptr);
+    e->SetControlFlag(1);
+    EXPECT_EQ(gControlFlag.load(), 1u);
+    e->SetControlFlag(3);
+    EXPECT_EQ(gControlFlag.load(), 1u);
+    e->SetControlFlag(2);
+    EXPECT_EQ(gControlFlag.load(), 0u);
+}
+
+}  // namespace
