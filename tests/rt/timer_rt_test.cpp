@@ -1,0 +1,473 @@
+// The timer with its thread serving at top SCHED_FIFO priority: deadlines are
+// never served early, new deadlines from other threads take effect at once
+// through the wake stand-in, the plain SIGALRM fallback behaves as designed,
+// and destruction is prompt and leaves nothing behind.
+#include <gtest/gtest.h>
+
+#include <pthread.h>
+#include <sched.h>
+#include <signal.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cstdio>
+#include <fstream>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "TestSupport.h"
+#include "nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.h"
+#include "tLinux/PalWake.h"
+
+namespace quelta {
+namespace {
+
+using testsupport::MonoNowNs;
+using Timer = tKPusLinuxNanoSleepTimer;
+
+constexpr uint64_t kUs = 1000ull;
+constexpr uint64_t kMs = 1000000ull;
+constexpr uint64_t kLate = 50 * kMs;  // lateness bound: loose, the VM is noisy
+
+ClockTime Ct(uint64_t ns) {
+    return ClockTime{static_cast<uint32_t>(ns), static_cast<uint32_t>(ns >> 32)};
+}
+
+int32_t Tid() { return static_cast<int32_t>(syscall(SYS_gettid)); }
+
+bool WaitUntil(const std::function<bool()>& done, uint64_t timeoutNs) {
+    const uint64_t end = MonoNowNs() + timeoutNs;
+    while (!done()) {
+        if (MonoNowNs() > end) return false;
+        usleep(200);
+    }
+    return true;
+}
+
+// --- callback recording -----------------------------------------------------
+
+constexpr int kMaxCalls = 1 << 16;
+std::atomic<int> gCalls{0};
+std::atomic<uint64_t> gCallTimes[kMaxCalls];
+std::atomic<void (*)()> gAfterCall{nullptr};  // a test's extra work in the callback
+
+void RecordCall() {
+    const uint64_t now = MonoNowNs();
+    const int i = gCalls.fetch_add(1);
+    if (i < kMaxCalls) gCallTimes[i].store(now);
+    if (void (*extra)() = gAfterCall.load()) extra();
+}
+
+uint64_t CallTime(int i) { return gCallTimes[i].load(); }
+
+class RtTimer : public ::testing::Test {
+protected:
+    void SetUp() override {
+        if (!testsupport::CanUseRealtime()) GTEST_SKIP() << "no SCHED_FIFO privilege";
+        gCalls.store(0);
+        gAfterCall.store(nullptr);
+        savedNr_ = gWakeSyscallNr.load();
+        gPalWakeStandInEnabled.store(true);
+    }
+    void TearDown() override {
+        gAfterCall.store(nullptr);
+        gPalWakeStandInEnabled.store(true);
+        gWakeSyscallNr.store(savedNr_);
+    }
+
+    static std::unique_ptr<Timer> Start(QueltaExpiryCallbackFn fn = &RecordCall) {
+        std::unique_ptr<Timer> timer(new Timer());
+        EXPECT_NE(timer, nullptr);
+        if (!timer) return timer;
+        EXPECT_EQ(timer->Initialize(fn), 0);
+        EXPECT_TRUE(timer->IsServing());
+        return timer;
+    }
+
+    // Waits until `n` callbacks have run.
+    static bool WaitCalls(int n, uint64_t timeoutNs = 2000 * kMs) {
+        return WaitUntil([n] { return gCalls.load() >= n; }, timeoutNs);
+    }
+
+    int32_t savedNr_ = 0;
+};
+
+// --- deadlines ------------------------------------------------------------
+
+TEST_F(RtTimer, CallbacksNeverRunBeforeTheirDeadline) {
+    auto timer = Start();
+    uint64_t worst = 0;
+    int n = 0;
+    for (int rep = 0; rep < 3; ++rep) {
+        for (uint64_t ahead : {200 * kUs, 500 * kUs, 1 * kMs, 2 * kMs, 5 * kMs, 10 * kMs}) {
+            const uint64_t deadline = MonoNowNs() + ahead;
+            timer->SetExpiry(Ct(deadline));
+            ASSERT_TRUE(WaitCalls(++n)) << "deadline " << ahead << " ns ahead never served";
+            const uint64_t at = CallTime(n - 1);
+            ASSERT_GE(at, deadline) << "served early, " << ahead << " ns ahead";
+            EXPECT_LT(at - deadline, kLate);
+            worst = std::max(worst, at - deadline);
+        }
+    }
+    printf("worst lateness over %d deadlines: %.1f us\n", n, worst / 1e3);
+}
+
+// The callback re-arms from the timer thread itself (no wake is attempted);
+// each new deadline is taken as soon as the callback returns.
+std::atomic<Timer*> gChainTimer{nullptr};
+std::atomic<int> gChainLinks{0};
+std::atomic<uint64_t> gChainDeadlines[64];
+
+void ReArm() {
+    const int i = gCalls.load() - 1;  // the call just recorded
+    if (i + 1 >= gChainLinks.load()) return;
+    const uint64_t next = gChainDeadlines[i].load() + 1 * kMs;
+    gChainDeadlines[i + 1].store(next);
+    gChainTimer.load()->SetExpiry(Ct(next));
+}
+
+TEST_F(RtTimer, CallbackReArmingFromInsideTheCallbackChains) {
+    auto timer = Start();
+    gChainTimer.store(timer.get());
+    gChainLinks.store(50);
+    gAfterCall.store(&ReArm);
+    gChainDeadlines[0].store(MonoNowNs() + 2 * kMs);
+    timer->SetExpiry(Ct(gChainDeadlines[0].load()));
+    ASSERT_TRUE(WaitCalls(50, 3000 * kMs)) << "chain stopped after " << gCalls.load();
+    usleep(20000);
+    EXPECT_EQ(gCalls.load(), 50) << "the chain's end must leave the timer parked";
+    for (int i = 0; i < 50; ++i) {
+        ASSERT_GE(CallTime(i), gChainDeadlines[i].load()) << "link " << i << " early";
+        EXPECT_LT(CallTime(i) - gChainDeadlines[i].load(), kLate) << "link " << i;
+    }
+}
+
+TEST_F(RtTimer, NewDeadlineFromAnotherThreadTakesEffectAtOnce) {
+    auto timer = Start();
+    timer->SetExpiry(Ct(MonoNowNs() + 10000 * kMs));  // a long sleep to be cut short
+    usleep(20000);
+    uint64_t deadline = 0;
+    std::thread([&] {
+        deadline = MonoNowNs() + 5 * kMs;
+        timer->SetExpiry(Ct(deadline));
+    }).join();
+    ASSERT_TRUE(WaitCalls(1, 1000 * kMs)) << "the new deadline waited for the old one";
+    const uint64_t at = CallTime(0);
+    ASSERT_GE(at, deadline);
+    printf("new deadline served %.1f us late\n", (at - deadline) / 1e3);
+    EXPECT_LT(at - deadline, 20 * kMs);
+    usleep(50000);
+    EXPECT_EQ(gCalls.load(), 1) << "the replaced deadline must not be served too";
+}
+
+TEST_F(RtTimer, ExpireNowAndPastDeadlinesRunAtOnce) {
+    auto timer = Start();
+    timer->SetExpiry(Ct(MonoNowNs() + 10000 * kMs));
+    usleep(10000);
+    uint64_t asked = 0;
+    std::thread([&] {
+        asked = MonoNowNs();
+        timer->ExpireNow();
+    }).join();
+    ASSERT_TRUE(WaitCalls(1, 1000 * kMs));
+    EXPECT_LT(CallTime(0) - asked, kLate);
+
+    asked = MonoNowNs();
+    timer->SetExpiry(Ct(asked - 1000 * kMs));
+    ASSERT_TRUE(WaitCalls(2, 1000 * kMs));
+    EXPECT_LT(CallTime(1) - asked, kLate);
+
+    // Nobody re-arms: the thread parks and the callback is not called again.
+    usleep(200000);
+    EXPECT_EQ(gCalls.load(), 2);
+}
+
+TEST_F(RtTimer, DeadlineSetBeforeTheThreadStartedIsServed) {
+    std::unique_ptr<Timer> timer(new Timer());
+    ASSERT_NE(timer, nullptr);
+    const uint64_t early = MonoNowNs() + 5 * kMs;
+    const uint64_t deadline = MonoNowNs() + 30 * kMs;
+    timer->SetExpiry(Ct(early));
+    timer->SetExpiry(Ct(deadline));  // the later call wins
+    ASSERT_EQ(timer->Initialize(&RecordCall), 0);
+    ASSERT_TRUE(WaitCalls(1, 1000 * kMs));
+    EXPECT_GE(CallTime(0), deadline);
+    EXPECT_LT(CallTime(0) - deadline, kLate);
+    usleep(30000);
+    EXPECT_EQ(gCalls.load(), 1);
+}
+
+// Two deadlines set while the thread is busy in the callback: it takes only
+// the one set last, once.
+std::atomic<bool> gHoldFirstCall{false};
+std::atomic<bool> gInFirstCall{false};
+void HoldFirstCall() {
+    if (gCalls.load() != 1) return;
+    gInFirstCall.store(true);
+    while (gHoldFirstCall.load()) usleep(100);
+}
+
+TEST_F(RtTimer, TwoSettingsBeforeATakeGiveOneCallbackAtTheLastSet) {
+    auto timer = Start();
+    gHoldFirstCall.store(true);
+    gInFirstCall.store(false);
+    gAfterCall.store(&HoldFirstCall);
+    timer->ExpireNow();
+    ASSERT_TRUE(WaitUntil([] { return gInFirstCall.load(); }, 1000 * kMs));
+    const uint64_t first = MonoNowNs() + 300 * kMs;
+    const uint64_t last = MonoNowNs() + 15 * kMs;
+    timer->SetExpiry(Ct(first));
+    timer->SetExpiry(Ct(last));
+    gHoldFirstCall.store(false);
+    ASSERT_TRUE(WaitCalls(2, 1000 * kMs));
+    EXPECT_GE(CallTime(1), last);
+    EXPECT_LT(CallTime(1), first) << "the overwritten deadline was served";
+    ASSERT_TRUE(WaitUntil([&] { return MonoNowNs() > first + 50 * kMs; }, 2000 * kMs));
+    EXPECT_EQ(gCalls.load(), 2);
+}
+
+// --- the thread -------------------------------------------------------------
+
+TEST_F(RtTimer, ThreadIsNamedAndRunsAtTopFifoPriority) {
+    auto timer = Start();
+    const int32_t tid = timer->state.threadId.load();
+    ASSERT_GT(tid, 0);
+    std::ifstream comm("/proc/self/task/" + std::to_string(tid) + "/comm");
+    std::string name;
+    std::getline(comm, name);
+    EXPECT_EQ(name, "QUELTAisr");
+    EXPECT_EQ(sched_getscheduler(tid), SCHED_FIFO);
+    sched_param param{};
+    ASSERT_EQ(sched_getparam(tid, &param), 0);
+    EXPECT_EQ(param.sched_priority, sched_get_priority_max(SCHED_FIFO));
+}
+
+class RtTimerDestruction : public RtTimer, public ::testing::WithParamInterface<bool> {};
+
+TEST_P(RtTimerDestruction, ParkedTimerEndsPromptlyAndLeavesNothingBehind) {
+    gPalWakeStandInEnabled.store(GetParam());
+    struct sigaction before {};
+    sigaction(SIGALRM, nullptr, &before);
+    const int threadsBefore = testsupport::CountThreads();
+
+    auto parked = Start();   // never armed: parked on the far deadline
+    auto sleeping = Start(); // armed ten seconds ahead
+    sleeping->SetExpiry(Ct(MonoNowNs() + 10000 * kMs));
+    const int32_t tids[] = {parked->state.threadId.load(), sleeping->state.threadId.load()};
+    usleep(10000);
+
+    for (std::unique_ptr<Timer>* timer : {&parked, &sleeping}) {
+        const uint64_t t0 = MonoNowNs();
+        timer->reset();
+        const uint64_t took = MonoNowNs() - t0;
+        printf("destruction took %.1f us\n", took / 1e3);
+        EXPECT_LT(took, 50 * kMs);
+    }
+    EXPECT_EQ(gCalls.load(), 0);
+
+    struct sigaction after {};
+    sigaction(SIGALRM, nullptr, &after);
+    EXPECT_EQ(after.sa_handler, before.sa_handler) << "SIGALRM action not restored";
+    EXPECT_EQ(testsupport::CountThreads(), threadsBefore);
+    for (int32_t tid : tids) EXPECT_EQ(PalWakeThreadId(tid, true), 38) << "wake slot kept";
+}
+
+INSTANTIATE_TEST_SUITE_P(StandIn, RtTimerDestruction, ::testing::Values(true, false),
+                         [](const ::testing::TestParamInfo<bool>& info) {
+                             return info.param ? "On" : "Off";
+                         });
+
+// --- the plain SIGALRM fallback -------------------------------------------
+
+std::atomic<int> gAlarms{0};
+std::atomic<int32_t> gAlarmTids[64];
+void CountingAlarm(int sig) {
+    const int i = gAlarms.fetch_add(1);
+    if (i < 64) gAlarmTids[i].store(Tid());
+    Timer::AlarmHandler(sig);
+}
+
+size_t Occurrences(const std::string& text, const std::string& what) {
+    size_t n = 0;
+    for (size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++n;
+    return n;
+}
+
+TEST_F(RtTimer, FallbackWarnsOncePerProcessSignalsEveryTimeAndServesAfterTheOldDeadline) {
+    gWakeSyscallNr.store(-1);
+    gPalWakeStandInEnabled.store(false);
+    gWakeWarningShown.store(0);
+
+    auto a = Start();
+    auto b = Start();
+    struct sigaction counting {}, timers {};
+    counting.sa_handler = &CountingAlarm;
+    sigemptyset(&counting.sa_mask);
+    sigaction(SIGALRM, &counting, &timers);
+    gAlarms.store(0);
+
+    testing::internal::CaptureStdout();
+    const uint64_t old = MonoNowNs() + 300 * kMs;
+    a->SetExpiry(Ct(old));
+    usleep(20000);
+    const uint64_t fresh = MonoNowNs() + 20 * kMs;
+    a->SetExpiry(Ct(fresh));  // cannot cut the sleep short: EINTR resumes it
+    for (int i = 0; i < 3; ++i) {
+        usleep(10000);
+        b->SetExpiry(Ct(MonoNowNs() + 10000 * kMs));
+    }
+    ASSERT_TRUE(WaitCalls(2, 2000 * kMs));
+    std::fflush(stdout);
+    const std::string out = testing::internal::GetCapturedStdout();
+
+    // The old deadline is served first; the new one, already past, right after.
+    EXPECT_GE(CallTime(0), old) << "the fallback must not end the sleep early";
+    EXPECT_GE(CallTime(1), CallTime(0));
+    EXPECT_LT(CallTime(1) - old, kLate);
+    printf("fallback: new deadline served %.1f ms late (old deadline %.1f ms later)\n",
+           (CallTime(1) - fresh) / 1e6, (old - fresh) / 1e6);
+
+    EXPECT_EQ(Occurrences(out, "Warning: using sched_wake_up system call -1 failed!\n"
+                               "This could lead to degraded nanosecond engine performance.\n"),
+              1u)
+        << out;
+    EXPECT_EQ(gAlarms.load(), 4) << "one SIGALRM per fallback wake";
+    const int32_t ta = a->state.threadId.load(), tb = b->state.threadId.load();
+    for (int i = 0; i < std::min(gAlarms.load(), 4); ++i) {
+        const int32_t t = gAlarmTids[i].load();
+        EXPECT_TRUE(t == ta || t == tb) << "SIGALRM went to thread " << t;
+    }
+    sigaction(SIGALRM, &timers, nullptr);
+}
+
+TEST_F(RtTimer, StandInServesSilently) {
+    gWakeSyscallNr.store(-1);
+    gWakeWarningShown.store(0);
+    auto timer = Start();
+    testing::internal::CaptureStdout();
+    std::thread([&] {
+        for (int i = 0; i < 5; ++i) {
+            timer->SetExpiry(Ct(MonoNowNs() + 10000 * kMs));
+            usleep(2000);
+        }
+        EXPECT_EQ(WakeTimerThread(timer->state.threadId.load()), 0);
+    }).join();
+    std::fflush(stdout);
+    EXPECT_EQ(testing::internal::GetCapturedStdout(), "");
+    EXPECT_EQ(gWakeWarningShown.load(), 0);
+}
+
+// --- concurrent setters -----------------------------------------------------
+//
+// Two threads set deadlines (some already past) at random moments while the
+// timer serves. Their settings are serialised by a test mutex so that each
+// has a sequence number k and deadline armed[k]. A callback is served for the
+// value that the thread took last; that value was set after the settings
+// completed before the previous callback ended (seq >= floor) and before the
+// callback began (seq <= seen). So each callback must come no earlier than
+// the smallest deadline in armed[floor..seen].
+
+constexpr int kMaxSets = 1 << 16;
+std::atomic<uint64_t> gArmed[kMaxSets];
+std::atomic<int> gSetStarted{0};
+std::atomic<int> gSetDone{0};
+std::atomic<int> gStressCalls{0};
+std::atomic<uint64_t> gStressAt[kMaxCalls];
+std::atomic<int> gStressSeen[kMaxCalls];
+std::atomic<int> gStressFloor[kMaxCalls];
+int gFloorForNext = 0;  // timer thread only
+
+void StressCall() {
+    const uint64_t now = MonoNowNs();
+    const int seen = gSetStarted.load();
+    const int i = gStressCalls.load();
+    if (i < kMaxCalls) {
+        gStressAt[i].store(now);
+        gStressSeen[i].store(seen);
+        gStressFloor[i].store(gFloorForNext);
+    }
+    gFloorForNext = gSetDone.load();
+    gStressCalls.store(i + 1);
+}
+
+TEST_F(RtTimer, ConcurrentSettersNeverGetEarlyCallbacksNorLoseTheLastWake) {
+    gStressCalls.store(0);
+    gSetStarted.store(0);
+    gSetDone.store(0);
+    gFloorForNext = 0;
+    auto timer = Start(&StressCall);
+    std::mutex setMutex;
+    auto set = [&](uint64_t deadline) {
+        std::lock_guard<std::mutex> hold(setMutex);
+        const int k = gSetStarted.load() + 1;
+        if (k >= kMaxSets) return false;
+        gArmed[k].store(deadline);
+        gSetStarted.store(k);
+        timer->SetExpiry(Ct(deadline));
+        gSetDone.store(k);
+        return true;
+    };
+
+    std::atomic<bool> stop{false};
+    auto writer = [&](uint32_t seed) {
+        while (!stop.load()) {
+            seed = seed * 1103515245u + 12345u;
+            const uint32_t r = seed >> 8;
+            const uint64_t deadline = (r % 16 == 0) ? 0  // ExpireNow-like
+                                                    : MonoNowNs() + (r % 1700) * kUs - 200 * kUs;
+            if (!set(deadline)) break;
+            const uint32_t pause = (seed >> 4) % 400;
+            if (pause > 20) usleep(pause);
+        }
+    };
+    std::thread w1(writer, 1u), w2(writer, 2u);
+    usleep(1500000);
+    stop.store(true);
+    w1.join();
+    w2.join();
+
+    // The last wake: a far deadline replaced by a near one must be served.
+    set(MonoNowNs() + 10000 * kMs);
+    uint64_t last = 0;
+    int lastSeq = 0;
+    std::thread([&] {
+        last = MonoNowNs() + 2 * kMs;
+        set(last);
+        lastSeq = gSetDone.load();
+    }).join();
+    // A callback may still serve a value taken before the far setting; the
+    // one for `last` must follow at once.
+    ASSERT_TRUE(WaitUntil(
+        [&] {
+            const int n = gStressCalls.load();
+            return n > 0 && gStressSeen[n - 1].load() >= lastSeq && gStressAt[n - 1].load() >= last;
+        },
+        1000 * kMs))
+        << "the last deadline was lost";
+    const int calls = gStressCalls.load();
+    timer.reset();
+
+    ASSERT_LE(calls, kMaxCalls);
+    EXPECT_GE(gStressAt[calls - 1].load(), last);
+    EXPECT_LT(gStressAt[calls - 1].load() - last, kLate);
+    int early = 0;
+    for (int i = 0; i < calls; ++i) {
+        const int lo = std::max(gStressFloor[i].load(), 1);
+        const int hi = gStressSeen[i].load();
+        ASSERT_LE(lo, hi) << "callback " << i << " ran with no deadline set for it";
+        uint64_t soonest = UINT64_MAX;
+        for (int k = lo; k <= hi; ++k) soonest = std::min(soonest, gArmed[k].load());
+        if (gStressAt[i].load() < soonest) ++early;
+    }
+    printf("%d settings, %d callbacks\n", gSetDone.load(), calls);
+    EXPECT_EQ(early, 0) << "callbacks served before any deadline they could belong to";
+}
+
+}  // namespace
+}  // namespace quelta
