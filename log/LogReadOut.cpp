@@ -44,14 +44,12 @@ void tKPLogEngine::ReadOutMerged(uint32_t& count, uint32_t timeLow[], uint32_t t
         records[other + i].writeIndex.store(0, kRelaxed);
         records[other + i].wrapCount.store(0, kRelaxed);
     }
-    activeBank.store(other, kRelaxed);
-    // Make the switch visible before the cursors are read: without the fence
-    // the processor may read the write indices first while the store still
-    // waits in its buffer, and recorders would go on filling the frozen rings
-    // under the read for that long. Afterwards at most the one entry each
-    // recorder is in the middle of can land in a frozen ring. One fence per
-    // read-out; recording stays fence-free.
-    std::atomic_thread_fence(std::memory_order_seq_cst);
+    // The switch is a sequentially consistent store so that it is visible
+    // before the cursors below are read: with a plain store the processor may
+    // read the write indices first while the store still waits in its buffer,
+    // and recorders would go on filling the frozen rings under the read for
+    // that long. One barrier per read-out; recording stays barrier-free.
+    activeBank.store(other, std::memory_order_seq_cst);
 
     // Cursors: each ring is read from its newest entry towards older ones. A
     // write index beyond the ring (a recorder racing a Configure) is treated

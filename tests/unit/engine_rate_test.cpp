@@ -254,8 +254,13 @@ TEST_F(EngineRateTest, HistogramModeRules) {
     EXPECT_EQ(e->HistogramMode(last, 3, 10, 101), 990u);
     const uint32_t beyond[] = {2000, 2000, 300};
     EXPECT_EQ(e->HistogramMode(beyond, 3, 10, 100), 300u);  // samples past the limit are not counted
-    const uint32_t big[] = {99990, 99990, 99980};
-    EXPECT_EQ(e->HistogramMode(big, 3, 10, 20000), 99980u);  // limit acts as 10000: 9999 is the last bucket
+    // A limit above 10000 acts as 10000: bucket 9999 is the last one.
+    const uint32_t big[] = {99980, 99980, 99990};
+    EXPECT_EQ(e->HistogramMode(big, 3, 10, 20000), 99980u);
+    const uint32_t top[] = {99990, 99990, 99980};
+    EXPECT_EQ(e->HistogramMode(top, 3, 10, 20000), 0u);
+    const uint32_t past[] = {100000, 100000, 99980};  // bucket 10000 does not exist
+    EXPECT_EQ(e->HistogramMode(past, 3, 10, 20000), 99980u);
     EXPECT_EQ(e->HistogramMode(big, 0, 10, 100), 0u);
     EXPECT_EQ(e->HistogramMode(a, 4, 0, 100), 0u);
     const uint32_t zeros[] = {0, 0, 5};

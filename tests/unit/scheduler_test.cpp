@@ -155,9 +155,11 @@ TEST_F(SchedulerTest, CallbackSettingItsNextTimeIsArmedAtOnce) {
     EXPECT_EQ(gCalls.size(), 2u);
 }
 
+void RecordArgument(void* arg) { gCalls.push_back({arg, 0}); }
+
 TEST_F(SchedulerTest, CallbackArgumentAndNeverTimeCancel) {
     int token = 0;
-    quelta_iTSC_SetCallback(RecordCallback, &token);
+    quelta_iTSC_SetCallback(RecordArgument, &token);
     ClockTime t = FromU64(h.Now() + 10);
     quelta_iTSC_SetCallbackTime(&t, 0);
     ClockTime never = kNeverTime;
