@@ -1,0 +1,167 @@
+// Cost of the log engine's recording and read-out, called as the runtime
+// calls them (virtual calls through an iKPLogEngine pointer), next to the
+// bare CLOCK_REALTIME read that stamping is built on.
+//
+// Goals: LogAt1 under 10 ns; LogNow5 within 10 ns of the bare clock read.
+// The LogNow5 runs come in two forms: with a timing engine in gEngine (the
+// library as loaded: the stamp is the engine's ReadGlobal7, which also
+// records the reading in the engine's last-global cell) and without one (the
+// log's own CLOCK_REALTIME fallback). Two threads on two CPUs recording at
+// once should each cost what one thread costs alone: every CPU has its own
+// ring. The shared-record run forces both threads onto one ring to show what
+// contention would look like.
+#include <benchmark/benchmark.h>
+#include <time.h>
+
+#include <algorithm>
+
+#include "engine/LibraryFrame.h"
+#include "engine/tKPusTimingEngine.h"
+#include "log/tKPLogEngine.h"
+#include "tLinux/PalThreads.h"
+
+namespace {
+
+using quelta::tKPLogEngine;
+using quelta::tKPusTimingEngine;
+
+// Opaque to the optimiser, so every call below stays a virtual call. Built
+// before main, so that threaded runs never race on its creation.
+iKPLogEngine* volatile gBenchLog = tKPLogEngine::Create();
+
+iKPLogEngine* Log() { return gBenchLog; }
+
+// Puts a timing engine into gEngine (on) or takes it out (off) for one run.
+void UseTimingEngine(bool on) {
+    static tKPusTimingEngine* engine = nullptr;
+    if (on && engine == nullptr) {
+        engine = new tKPusTimingEngine();
+        engine->SetEpochOffset(2082844800);
+    }
+    quelta::gEngine.store(on ? engine : nullptr);
+}
+
+// Recording on a ring of the default size; reconfigured per run so every run
+// starts with empty rings and recording in the given state.
+iKPLogEngine* Prepared(bool recording) {
+    iKPLogEngine* log = Log();
+    log->Reconfigure();
+    if (recording) log->SetEnabled(1);
+    return log;
+}
+
+void BM_RawClockGettimeRealtime(benchmark::State& state) {
+    for (auto _ : state) {
+        timespec ts;
+        clock_gettime(CLOCK_REALTIME, &ts);
+        benchmark::DoNotOptimize(ts);
+    }
+}
+BENCHMARK(BM_RawClockGettimeRealtime);
+
+void BM_LogAt1(benchmark::State& state) {
+    iKPLogEngine* log = Prepared(state.range(0) != 0);
+    ClockTime t = {0x12345678u, 0x9u};
+    for (auto _ : state) {
+        log->LogAt1(t, 0x42);
+        ++t.low;
+    }
+}
+BENCHMARK(BM_LogAt1)->ArgName("recording")->Arg(1)->Arg(0);
+
+void BM_LogAtWithData(benchmark::State& state) {
+    iKPLogEngine* log = Prepared(true);
+    ClockTime t = {0x12345678u, 0x9u};
+    for (auto _ : state) {
+        log->LogAtWithData(t, 0xD47A, 0x43);
+        ++t.low;
+    }
+}
+BENCHMARK(BM_LogAtWithData);
+
+// range(0): recording on/off; range(1): timing engine in gEngine or the
+// log's fallback clock.
+void BM_LogNow5(benchmark::State& state) {
+    UseTimingEngine(state.range(1) != 0);
+    iKPLogEngine* log = Prepared(state.range(0) != 0);
+    for (auto _ : state) log->LogNow5(0x44);
+    UseTimingEngine(false);
+}
+BENCHMARK(BM_LogNow5)
+    ->ArgNames({"recording", "engine"})
+    ->Args({1, 1})
+    ->Args({0, 1})
+    ->Args({1, 0})
+    ->Args({0, 0});
+
+// One read-out of the newest 10,000 entries, merged across all CPUs; the
+// counter is the cost per entry handed out.
+thread_local int tBenchCpu = 0;
+int BenchCpu() { return tBenchCpu; }
+
+void BM_ReadOut10000(benchmark::State& state) {
+    constexpr uint32_t kEntries = 10000;
+    iKPLogEngine* log = Log();
+    tKPLogEngine* engine = static_cast<tKPLogEngine*>(log);
+    const uint32_t cpus = engine->CpuCount();
+    const uint32_t perCpu = (kEntries + cpus - 1) / cpus;
+    log->Configure(static_cast<int32_t>(std::max<uint32_t>(perCpu, 5000)));
+    log->SetEnabled(1);
+    int (*saved)() = quelta::gLogCpuQuery;
+    quelta::gLogCpuQuery = BenchCpu;
+    for (uint32_t i = 0; i < perCpu * cpus; ++i) {  // interleaved times on every CPU
+        tBenchCpu = static_cast<int>(i % cpus);
+        log->LogAt1(ClockTime{1000 + i, 1}, i);
+    }
+    tBenchCpu = 0;
+    quelta::gLogCpuQuery = saved;
+
+    static uint32_t low[kEntries], high[kEntries], events[kEntries], data[kEntries];
+    for (auto _ : state) {
+        uint32_t count = kEntries;
+        log->ReadOutMerged(count, low, high, events, data, 0);
+        benchmark::DoNotOptimize(count);
+        if (count != kEntries) state.SkipWithError("read-out returned too few entries");
+    }
+    state.counters["cpus"] = cpus;
+    state.counters["per_entry"] =
+        benchmark::Counter(kEntries, benchmark::Counter::kIsIterationInvariantRate |
+                                         benchmark::Counter::kInvert);
+    log->Reconfigure();
+}
+BENCHMARK(BM_ReadOut10000)->Unit(benchmark::kMicrosecond);
+
+// Threads pinned to CPUs 0 and 1 (or to one CPU, as the baseline) record
+// LogAt1 at once; the time shown is per record and thread. range(0) = 1
+// forces every thread onto ring 0 (contention on purpose).
+int SharedRing() { return 0; }
+
+void BM_LogAt1_Pinned(benchmark::State& state) {
+    const bool shared = state.range(0) != 0;
+    static int (*saved)() = nullptr;  // thread 0's alone
+    if (state.thread_index() == 0) {
+        saved = quelta::gLogCpuQuery;
+        quelta::PalInitialize();
+        Prepared(true);
+        if (shared) quelta::gLogCpuQuery = SharedRing;
+    }
+    // Each thread pins itself; the timed loops start together once every
+    // thread is ready and end together before the code after them runs.
+    const bool pinned = quelta::PalSetAffinityOne(static_cast<int32_t>(state.thread_index())) == 0;
+    iKPLogEngine* log = Log();
+    ClockTime t = {0x12345678u, 0x9u};
+    for (auto _ : state) {
+        log->LogAt1(t, 0x45);
+        ++t.low;
+    }
+    if (!pinned) state.SkipWithError("could not pin the thread to its CPU");
+    quelta::PalSetAffinityAll();
+    if (state.thread_index() == 0) quelta::gLogCpuQuery = saved;
+}
+
+BENCHMARK(BM_LogAt1_Pinned)->ArgName("shared_ring")->Arg(0)->Threads(1)->Threads(2)->UseRealTime();
+BENCHMARK(BM_LogAt1_Pinned)->ArgName("shared_ring")->Arg(1)->Threads(2)->UseRealTime();
+
+}  // namespace
+
+BENCHMARK_MAIN();
