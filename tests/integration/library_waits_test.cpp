@@ -1,7 +1,9 @@
 // Every wait of the exported interface, through the loaded library: never
 // early, results as documented, refusals when the library cannot serve.
 #include <gtest/gtest.h>
+#include <signal.h>
 #include <time.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <thread>
@@ -166,6 +168,54 @@ TEST_F(LibraryWaits, GlobalClockWaitEndsAtTheWallClockTarget) {
     api().WaitUntilGlobalClocks64(&zero, &abortFlag, &after, generation);
     EXPECT_EQ(abortFlag, 0u);
     EXPECT_NEAR(static_cast<double>(U64(after)), static_cast<double>(GlobalNow()), 1e9);
+}
+
+void OnUsr1(int) {}
+
+TEST_F(LibraryWaits, ASignalFloodShortensNoWait) {
+    struct sigaction sa {};
+    sa.sa_handler = OnUsr1;  // no SA_RESTART: every blocking call sees EINTR
+    sigemptyset(&sa.sa_mask);
+    struct sigaction old {};
+    sigaction(SIGUSR1, &sa, &old);
+    std::atomic<bool> done{false};
+    std::atomic<int> early{0};
+    std::thread waiter([&] {
+        PalSemaphore* s = testsupport::NewRuntimeSemaphore();
+        for (int i = 0; i < 4; ++i) {
+            uint64_t t0 = MonoNowNs();
+            if (api().EventWait(s, 8000) != 1 || MonoNowNs() < t0 + 8 * kMs) early++;
+            ClockTime now;
+            engine()->ReadMonotonic0(now);
+            const ClockTime d = CT(U64(now) + 6 * kMs);
+            api().EventWaitCallback(nullptr, &d, nullptr, nullptr, 0, nullptr);
+            if (MonoNowNs() < U64(d)) early++;
+            const ClockTime target = CT(GlobalNow() + 5 * kMs);
+            ClockTime after{};
+            api().WaitUntilGlobalClocks64(&target, nullptr, &after, 0);
+            if (U64(after) < U64(target)) early++;
+            t0 = MonoNowNs();
+            api().WaitMicroSeconds(7000);
+            if (MonoNowNs() < t0 + 7 * kMs) early++;
+            engine()->ReadMonotonic0(now);
+            const ClockTime until = CT(U64(now) + 5 * kMs);
+            api().WaitUntilClocks64(&until);
+            if (MonoNowNs() < U64(until)) early++;
+        }
+        testsupport::DeleteRuntimeSemaphore(s);
+        done = true;
+    });
+    const pthread_t target = waiter.native_handle();
+    uint64_t sent = 0;
+    while (!done.load()) {
+        pthread_kill(target, SIGUSR1);
+        ++sent;
+        usleep(100);
+    }
+    waiter.join();
+    sigaction(SIGUSR1, &old, nullptr);
+    EXPECT_EQ(early.load(), 0) << "signals sent: " << sent;
+    EXPECT_GT(sent, 100u);
 }
 
 std::atomic<uint64_t> gCallbackAt{0};

@@ -57,6 +57,28 @@ int SteppedGetTime(clockid_t id, timespec* ts) {
     return r;
 }
 
+// A deterministic clock for the user-space conversion: every read moves the
+// true time on by kReadNs, one chosen read is delayed further (as if the
+// thread were preempted just before it), and CLOCK_REALTIME runs exactly
+// kRealOffsetNs ahead of CLOCK_MONOTONIC.
+constexpr uint64_t kReadNs = 50;
+constexpr uint64_t kRealOffsetNs = 1700000000ull * kNs + 123;
+struct TickingClock {
+    uint64_t now = 5 * kNs;
+    int reads = 0;
+    int delayedRead = 0;
+    uint64_t delayNs = 0;
+};
+TickingClock gTicking;
+int TickingGetTime(clockid_t id, timespec* ts) {
+    if (++gTicking.reads == gTicking.delayedRead) gTicking.now += gTicking.delayNs;
+    gTicking.now += kReadNs;
+    const uint64_t v = id == CLOCK_REALTIME ? gTicking.now + kRealOffsetNs : gTicking.now;
+    ts->tv_sec = static_cast<time_t>(v / kNs);
+    ts->tv_nsec = static_cast<long>(v % kNs);
+    return 0;
+}
+
 class EngineConversionTest : public ::testing::Test {
 protected:
     void SetUp() override { engine->SetEpochOffset(kEpoch1904); }
@@ -185,6 +207,28 @@ TEST_F(EngineConversionTest, StandInFollowsEveryStepOfTheWallClock) {
         EXPECT_LE(std::abs(Diff(ToGlobal(nowM), GlobalNow())), 500000);
     }
     gStepNs = 0;
+}
+
+TEST_F(EngineConversionTest, StandInTakesTheMidpointOfTheTightestBracket) {
+    gConvertSyscallNr.store(-1);
+    quelta::gSystemClock.getTime = &TickingGetTime;
+    const uint64_t point = 1234 * kNs + 5678;
+    for (int delayed : {0, 1, 2, 3}) {  // none, or the first try's 1st, 2nd or 3rd read
+        SCOPED_TRACE(delayed);
+        gTicking = TickingClock{};
+        gTicking.delayedRead = delayed;
+        gTicking.delayNs = 100000;
+        timespec ts = quelta::WidenTimespec(quelta::SplitNanoseconds(point));
+        ASSERT_EQ(ConvertClockTime(CLOCK_MONOTONIC, CLOCK_REALTIME, &ts), 0);
+        EXPECT_EQ(quelta::JoinNanoseconds(quelta::NarrowTimespec(ts)), point + kRealOffsetNs);
+        // A tight first bracket is taken at once; a disturbed one is retried.
+        EXPECT_EQ(gTicking.reads, delayed == 0 ? 3 : 6);
+
+        gTicking.reads = 0;
+        ts = quelta::WidenTimespec(quelta::SplitNanoseconds(point + kRealOffsetNs));
+        ASSERT_EQ(ConvertClockTime(CLOCK_REALTIME, CLOCK_MONOTONIC, &ts), 0);
+        EXPECT_EQ(quelta::JoinNanoseconds(quelta::NarrowTimespec(ts)), point);
+    }
 }
 
 TEST_F(EngineConversionTest, StandInConvertsBetweenRawAndMonotonic) {

@@ -231,6 +231,13 @@ TEST_F(EngineRateTest, StepGlobalClockKeeps32BitSeconds) {
     gFake.realtime = Ts(0x7FFFFFFF, 0);
     EXPECT_EQ(e->StepGlobalClock(CT(kNs)), 0);
     EXPECT_EQ(static_cast<int64_t>(gKernel.setTimeArg.tv_sec), int64_t(INT32_MIN));
+    // At the 32-bit wrap the seconds read are negative on every target, and
+    // the unsigned split of the negative sum gives the same (wrapped)
+    // seconds on a 64-bit time_t build as on the 32-bit target.
+    gFake.realtime = Ts(static_cast<time_t>(sizeof(time_t) > 4 ? 0x80000000ll : INT32_MIN), 0);
+    EXPECT_EQ(e->StepGlobalClock(CT(0)), 0);
+    EXPECT_EQ(static_cast<int64_t>(gKernel.setTimeArg.tv_sec), int64_t(-880608759));
+    EXPECT_EQ(gKernel.setTimeArg.tv_nsec, 709551616);
 }
 
 TEST_F(EngineRateTest, StepGlobalClockSetsNothingWhenTheClockCannotBeRead) {

@@ -1,0 +1,77 @@
+# Shared by the packaging tests. The test's CMake registration passes the
+# build's facts in the environment: BUILD_DIR SOURCE_DIR LIBDIR INCLUDEDIR
+# BINDIR VERSION DEB_ARCH HAS_PROBE CMAKE CPACK CXX GENERATOR MAKE_PROGRAM.
+set -euo pipefail
+
+for v in BUILD_DIR SOURCE_DIR LIBDIR INCLUDEDIR BINDIR VERSION CMAKE CXX; do
+  [ -n "${!v:-}" ] || { echo "packaging test: $v not set" >&2; exit 2; }
+done
+MAJOR=${VERSION%%.*}
+HERE=$(cd "$(dirname "${BASH_SOURCE[0]}")" && pwd)
+
+SCRATCH=$(mktemp -d "${TMPDIR:-/tmp}/quelta-packaging.XXXXXX")
+trap 'rm -rf "$SCRATCH"' EXIT
+
+failures=0
+fail() { echo "FAIL: $*"; failures=$((failures + 1)); }
+pass() { echo "ok: $*"; }
+# expect_eq what actual expected
+expect_eq() {
+  if [ "$2" = "$3" ]; then pass "$1"; else fail "$1: got '$2', expected '$3'"; fi
+}
+# expect_same_list what actual-file expected-file (one entry a line)
+expect_same_list() {
+  if diff -u "$3" "$2" >"$SCRATCH/diff.txt"; then
+    pass "$1"
+  else
+    fail "$1 (- expected, + found):"
+    sed -n '3,$p' "$SCRATCH/diff.txt"
+  fi
+}
+finish() {
+  if [ "$failures" -eq 0 ]; then echo "all checks passed"; exit 0; fi
+  echo "$failures check(s) failed"
+  exit 1
+}
+# Runs a command quietly; on failure shows its output and stops the test.
+run_quiet() {
+  local log="$SCRATCH/command.log"
+  if ! "$@" >"$log" 2>&1; then
+    echo "FAIL: command failed: $*"
+    cat "$log"
+    exit 1
+  fi
+}
+
+# cmake --install of the build tree into a scratch prefix.
+install_into() { run_quiet "$CMAKE" --install "$BUILD_DIR" --prefix "$1"; }
+
+# The installed files of the public headers, relative to an include dir.
+public_headers() {
+  (cd "$SOURCE_DIR/include" && find quelta -type f -name '*.h' | LC_ALL=C sort)
+}
+
+# Everything the development side installs, relative to the prefix, with
+# the per-configuration targets file named quelta-targets-CONFIG.cmake.
+expected_development_files() {
+  public_headers | sed "s|^|$INCLUDEDIR/|"
+  echo "$LIBDIR/libquelta.so"
+  echo "$LIBDIR/pkgconfig/quelta.pc"
+  echo "$LIBDIR/cmake/quelta/quelta-config.cmake"
+  echo "$LIBDIR/cmake/quelta/quelta-config-version.cmake"
+  echo "$LIBDIR/cmake/quelta/quelta-targets.cmake"
+  echo "$LIBDIR/cmake/quelta/quelta-targets-CONFIG.cmake"
+}
+expected_runtime_files() {
+  echo "$LIBDIR/libquelta.so.$MAJOR"
+  echo "$LIBDIR/libquelta.so.$VERSION"
+}
+normalise_config() { sed 's|/quelta-targets-[a-z]*\.cmake$|/quelta-targets-CONFIG.cmake|'; }
+
+# Files and links below a directory, relative to it, sorted.
+tree_of() {
+  (cd "$1" && find . \( -type f -o -type l \) | sed 's|^\./||' | normalise_config | LC_ALL=C sort)
+}
+
+# SONAME of an ELF shared object.
+soname_of() { readelf -d "$1" | sed -n 's/.*(SONAME).*\[\(.*\)\].*/\1/p'; }
