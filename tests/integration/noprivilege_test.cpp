@@ -59,7 +59,8 @@ std::string ChildChecks() {
     if (api.EventWaitCallback(s, &deadline, nullptr, nullptr, 0, &node) != 1)
         return "caller-semaphore wait did not report no timer";
     lib.engine()->ReleaseWait(node);
-    if (api.SetCallbackTime(&now, 0) != 0) return "callback time was accepted without a timer";
+    const ClockTime past{0, 0};  // earlier than any armed deadline: needs arming
+    if (api.SetCallbackTime(&past, 0) != 0) return "callback time was accepted without a timer";
     ClockTime g;
     uint32_t generation = 0;
     lib.engine()->ReadGlobalWithGeneration(g, generation);

@@ -2,6 +2,8 @@
 
 #include <dlfcn.h>
 
+#include <mutex>
+
 #include "tLinux/PalSemaphoreOps.h"
 #include "tLinux/PalThreads.h"
 
@@ -45,7 +47,9 @@ LoadedLibrary::~LoadedLibrary() {
 }
 
 PalSemaphore* NewRuntimeSemaphore() {
-    quelta::PalInitialize();
+    // The platform layer is initialised once, as a runtime's start-up would.
+    static std::once_flag once;
+    std::call_once(once, [] { quelta::PalInitialize(); });
     PalSemaphore* s = nullptr;
     quelta::PalSemaphoreCreate(&s);
     return s;

@@ -58,13 +58,13 @@ int SteppedGetTime(clockid_t id, timespec* ts) {
 }
 
 // A deterministic clock for the user-space conversion: every read moves the
-// true time on by kReadNs, one chosen read is delayed further (as if the
+// true time on by readNs, one chosen read is delayed further (as if the
 // thread were preempted just before it), and CLOCK_REALTIME runs exactly
 // kRealOffsetNs ahead of CLOCK_MONOTONIC.
-constexpr uint64_t kReadNs = 50;
 constexpr uint64_t kRealOffsetNs = 1700000000ull * kNs + 123;
 struct TickingClock {
     uint64_t now = 5 * kNs;
+    uint64_t readNs = 50;
     int reads = 0;
     int delayedRead = 0;
     uint64_t delayNs = 0;
@@ -72,7 +72,7 @@ struct TickingClock {
 TickingClock gTicking;
 int TickingGetTime(clockid_t id, timespec* ts) {
     if (++gTicking.reads == gTicking.delayedRead) gTicking.now += gTicking.delayNs;
-    gTicking.now += kReadNs;
+    gTicking.now += gTicking.readNs;
     const uint64_t v = id == CLOCK_REALTIME ? gTicking.now + kRealOffsetNs : gTicking.now;
     ts->tv_sec = static_cast<time_t>(v / kNs);
     ts->tv_nsec = static_cast<long>(v % kNs);
@@ -221,13 +221,27 @@ TEST_F(EngineConversionTest, StandInTakesTheMidpointOfTheTightestBracket) {
         timespec ts = quelta::WidenTimespec(quelta::SplitNanoseconds(point));
         ASSERT_EQ(ConvertClockTime(CLOCK_MONOTONIC, CLOCK_REALTIME, &ts), 0);
         EXPECT_EQ(quelta::JoinNanoseconds(quelta::NarrowTimespec(ts)), point + kRealOffsetNs);
-        // A tight first bracket is taken at once; a disturbed one is retried.
-        EXPECT_EQ(gTicking.reads, delayed == 0 ? 3 : 6);
+        // A tight first bracket is taken at once (a delay before its first
+        // read does not widen it); a widened one is retried.
+        EXPECT_EQ(gTicking.reads, delayed <= 1 ? 3 : 6);
 
         gTicking.reads = 0;
         ts = quelta::WidenTimespec(quelta::SplitNanoseconds(point + kRealOffsetNs));
         ASSERT_EQ(ConvertClockTime(CLOCK_REALTIME, CLOCK_MONOTONIC, &ts), 0);
         EXPECT_EQ(quelta::JoinNanoseconds(quelta::NarrowTimespec(ts)), point);
+    }
+    // Brackets never tight enough to stop early: all three tries are made and
+    // the undisturbed one wins, wherever it lies.
+    for (int delayed : {2, 5, 8}) {
+        SCOPED_TRACE(delayed);
+        gTicking = TickingClock{};
+        gTicking.readNs = 400;
+        gTicking.delayedRead = delayed;
+        gTicking.delayNs = 100000;
+        timespec ts = quelta::WidenTimespec(quelta::SplitNanoseconds(point));
+        ASSERT_EQ(ConvertClockTime(CLOCK_MONOTONIC, CLOCK_REALTIME, &ts), 0);
+        EXPECT_EQ(quelta::JoinNanoseconds(quelta::NarrowTimespec(ts)), point + kRealOffsetNs);
+        EXPECT_EQ(gTicking.reads, 9);
     }
 }
 
