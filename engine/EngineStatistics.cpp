@@ -35,6 +35,8 @@ const std::atomic<uint32_t>& BlockWord(const StatisticsBlock& b, uint32_t i) {
     return b.globalReadSamples[i - kStatsSamples];
 }
 
+// The give-up clock of CalibrateWithin reads the kernel directly, not through
+// the replaceable clock calls: a test's fake clock must not stall it.
 uint64_t MonotonicMs() {
     timespec ts{};
     clock_gettime(CLOCK_MONOTONIC, &ts);

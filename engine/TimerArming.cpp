@@ -20,6 +20,10 @@ uint32_t ArmTimer(const ClockTime& when) {
     iKPusLinuxTimer* t = timer;
     if (IsNever(when)) {
         t->ExpireNow();
+    } else if (when.high == 0xFFFFFFFFu) {
+        // Such a time comes before 0 in the library's order: it has passed.
+        // Taken as an unsigned count it would park the timer for decades.
+        t->SetExpiry(ClockTime{0, 0});
     } else {
         t->SetExpiry(when);
     }

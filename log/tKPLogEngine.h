@@ -45,7 +45,6 @@ public:
     // allocated; nothing is left allocated then.
     static tKPLogEngine* Create();
 
-    tKPLogEngine();
     ~tKPLogEngine() override;
 
     // --- slots 0-23 (see iKPLogEngine) ---
@@ -94,6 +93,10 @@ public:
     LogCpuRecord* records;               // 2 x cpuCount, bank 0 then bank 1
 
 private:
+    // Only Create builds engines: it discards one whose record array could
+    // not be had, so every engine in use has its records.
+    tKPLogEngine();
+
     // The CPU count is read once: the record array was sized with it, and a
     // later answer (the platform layer asks again after a failed query) must
     // never index beyond the array.

@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # Installs what building and testing need on Debian 12, as root, when missing.
 set -euo pipefail
-want=(cmake g++ make ninja-build googletest libgtest-dev libbenchmark-dev
+want=(cmake g++ make ninja-build pkg-config googletest libgtest-dev libbenchmark-dev
       g++-arm-linux-gnueabihf libc6-dev-armhf-cross qemu-user util-linux binutils)
 missing=()
 for p in "${want[@]}"; do

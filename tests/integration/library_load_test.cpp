@@ -53,6 +53,7 @@ TEST(LibraryExports, OnlyTheRuntimeInterfaceIsExported) {
         if (num.empty() || num.back() != ':' || !isdigit(static_cast<unsigned char>(num[0]))) continue;
         EXPECT_NE(bind, "UNIQUE") << "a unique symbol keeps the library mapped: " << line;
         if (ndx == "UND" || !(f >> name)) continue;
+        if (bind == "LOCAL") continue;  // section symbols some targets list
         name = name.substr(0, name.find('@'));
         defined.insert(name);
     }
@@ -89,10 +90,10 @@ TEST(LibraryLifetime, LoadStartsEverythingAndTicksEveryMillisecond) {
     const uint64_t ticks = gTicks.load();
     const uint64_t elapsedMs = (testsupport::MonoNowNs() - start) / 1000000;
     std::printf("ticks in one second: %llu\n", static_cast<unsigned long long>(ticks));
-    // One tick per millisecond; late passes restart the grid and never replay,
-    // so a noisy machine only ever loses ticks, never gains them.
-    EXPECT_GT(ticks, 500u);
-    EXPECT_LE(ticks, elapsedMs + 2);
+    // One tick per millisecond. A late pass restarts the grid at once (one
+    // extra tick right behind it) and never replays the missed ones.
+    EXPECT_GT(ticks, elapsedMs / 2);
+    EXPECT_LE(ticks, elapsedMs + elapsedMs / 10 + 5);
 }
 
 TEST(LibraryLifetime, EpochOffsetInUtcIs1904) {

@@ -36,21 +36,22 @@ expect_eq "find_package found the installed package" \
 run_quiet "$CMAKE" --build "$SCRATCH/cmake-build"
 check_runs "CMake consumer" "$SCRATCH/cmake-build/consumer"
 
-# 3. The package's version and imported target, without compiling: a
-# request for another major version or a newer minor is refused, and
-# quelta::quelta points into the prefix.
+# 3. The package's version and imported target, without compiling (so
+# without a library architecture: the package directory is named): a request
+# for another major version or a newer minor is refused, and quelta::quelta
+# points into the prefix.
 mkdir -p "$SCRATCH/query"
 cat >"$SCRATCH/query/CMakeLists.txt" <<'CMAKE'
 cmake_minimum_required(VERSION 3.16)
 project(query LANGUAGES NONE)
 foreach(refused 5 7 6.1)
-  find_package(quelta ${refused} CONFIG QUIET)
+  find_package(quelta ${refused} CONFIG QUIET PATHS ${package_dir} NO_DEFAULT_PATH)
   if(quelta_FOUND)
     message(STATUS "QUERY accepted ${refused}")
   endif()
   unset(quelta_DIR CACHE)
 endforeach()
-find_package(quelta 6.0 CONFIG REQUIRED)
+find_package(quelta 6.0 CONFIG REQUIRED PATHS ${package_dir} NO_DEFAULT_PATH)
 message(STATUS "QUERY version=${quelta_VERSION}")
 get_target_property(inc quelta::quelta INTERFACE_INCLUDE_DIRECTORIES)
 message(STATUS "QUERY include=${inc}")
@@ -63,8 +64,7 @@ message(STATUS "QUERY soname=${soname}")
 get_target_property(links quelta::quelta INTERFACE_LINK_LIBRARIES)
 message(STATUS "QUERY links=${links}")
 CMAKE
-"$CMAKE" -S "$SCRATCH/query" -B "$SCRATCH/query/build" -DCMAKE_PREFIX_PATH="$prefix" \
-  -DCMAKE_FIND_USE_PACKAGE_REGISTRY=OFF >"$SCRATCH/query.log" 2>&1 || { cat "$SCRATCH/query.log"; fail "version query"; }
+"$CMAKE" -S "$SCRATCH/query" -B "$SCRATCH/query/build" -Dpackage_dir="$lib/cmake/quelta" >"$SCRATCH/query.log" 2>&1 || { cat "$SCRATCH/query.log"; fail "version query"; }
 q() { sed -n "s/^-- QUERY $1=//p" "$SCRATCH/query.log"; }
 if grep -q "QUERY accepted" "$SCRATCH/query.log"; then
   fail "package accepted an incompatible version: $(grep 'QUERY accepted' "$SCRATCH/query.log")"

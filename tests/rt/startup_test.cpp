@@ -90,7 +90,9 @@ TEST(Startup, EveryAllocationFailureIsReportedAndReleasedOnce) {
             EXPECT_EQ(GetLogEngine__MERIDOX(), nullptr) << k;  // released at once
             // A failed event system deletes the timer at once and keeps the
             // engine and the pool for the stop.
-            if (gEngine.load() != nullptr) EXPECT_EQ(gTimer.load(), nullptr) << k;
+            if (gEngine.load() != nullptr) {
+                EXPECT_EQ(gTimer.load(), nullptr) << k;
+            }
         } else {
             // A log ring that cannot be had falls back to the inline ring.
             ++survived;

@@ -189,16 +189,6 @@ TEST_F(EngineRateTest, GetClockRateRebuildsTheRateWord) {
     EXPECT_NEAR(e->GetClockRate(), 99.985, 1e-9);
 }
 
-TEST_F(EngineRateTest, SetThenReadRoundTrips) {
-    for (double rate : {100.0, 101.0, 50.0, 100.5}) {
-        SCOPED_TRACE(rate);
-        SetRate(rate);
-        gKernel.readTick = gKernel.lastSet.tick;
-        gKernel.readFreq = gKernel.lastSet.freq;
-        EXPECT_NEAR(e->GetClockRate(), rate, 1e-6);
-    }
-}
-
 TEST_F(EngineRateTest, StepGlobalClockAddsASignedDelta) {
     UseFakeClock();
     gFake.realtime = Ts(1700000000, 999999999);

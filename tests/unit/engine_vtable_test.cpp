@@ -314,6 +314,14 @@ TEST_F(EngineVtableTest, Slots36To38MicrosecondWaits) {
     after = testsupport::MonoNowNs();
     EXPECT_GE(after / 1000 + 1, before / 1000 + 1500);
     EXPECT_LE(r - target, (after - before) / 1000 + 1);
+
+    // A target that has just passed (500 us ago) is not waited for. (Taken
+    // as a duration or a period it would mean a long sleep.)
+    before = testsupport::MonoNowNs();
+    r = Wait32(e, 38, static_cast<uint32_t>(before / 1000 - 500));
+    after = testsupport::MonoNowNs();
+    EXPECT_LT(after - before, 500 * kMs);
+    EXPECT_LE(r - static_cast<uint32_t>(before / 1000), (after - before) / 1000 + 1);
 }
 
 TEST_F(EngineVtableTest, Slots39To42ClockWaits) {
@@ -345,6 +353,13 @@ TEST_F(EngineVtableTest, Slots39To42ClockWaits) {
     after = testsupport::MonoNowNs();
     EXPECT_GE(after, before + 1500000);
     EXPECT_LE(r - target32, after - before);
+
+    // A target that has just passed (0.5 ms ago) is not waited for.
+    before = testsupport::MonoNowNs();
+    r = Wait32(e, 42, static_cast<uint32_t>(before - 500000));
+    after = testsupport::MonoNowNs();
+    EXPECT_LT(after - before, 500 * kMs);
+    EXPECT_LE(r - static_cast<uint32_t>(before), after - before);
 }
 
 TEST_F(EngineVtableTest, Slots43To48FlagServiceAndCells) {

@@ -126,6 +126,11 @@ int32_t PalWakeThreadId(int32_t threadId, bool force) {
     PalWakeSlot* slot = FindSlot(threadId);
     if (slot == nullptr) return ENOSYS;
     slot->wakeRequested.store(1);
+    // The sleeper publishes its request before it looks at the flag, and we
+    // set the flag before we look at the request: if we find none, the
+    // sleeper is not sleeping and will see the flag before its next sleep, so
+    // the signal (which would only interrupt whatever it is doing) is spared.
+    if (slot->request.load() == nullptr) return 0;
     return pthread_kill(slot->thread.load(std::memory_order_relaxed), SIGALRM);
 }
 

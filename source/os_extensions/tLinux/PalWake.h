@@ -44,7 +44,8 @@ PalSleepResult PalWakeableSleepUntil(PalWakeSlot* slot, const timespec& deadline
 void PalWakeClear(PalWakeSlot* slot);
 
 // Requests a wake of the registered thread with kernel id `threadId`: sets
-// its request flag and sends it SIGALRM. Returns 0, or 38 (ENOSYS) when the
+// its request flag and, if the thread is inside PalWakeableSleepUntil, sends
+// it SIGALRM. Returns 0 (or pthread_kill's error), or 38 (ENOSYS) when the
 // stand-in cannot serve (no such registered thread, or switched off through
 // the seam; `force` ignores the seam, for a timer's own shutdown).
 int32_t PalWakeThreadId(int32_t threadId, bool force = false);

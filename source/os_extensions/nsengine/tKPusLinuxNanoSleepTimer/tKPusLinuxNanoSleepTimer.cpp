@@ -80,7 +80,6 @@ int32_t tKPusLinuxNanoSleepTimer::Initialize(QueltaExpiryCallbackFn callback) {
     state.stopRequested.store(0);
 
     if (pthread_rwlock_init(&state.expiryLock, nullptr) != 0) return 1;
-    lockInitialised_ = true;
 
     if (gWakeSyscallNr.load() == 0) {
         FILE* file = std::fopen("/sys/kernel/zq_syscall_sched_wake_up", "r");

@@ -77,7 +77,6 @@ public:
     pthread_attr_t threadAttr;
 
 private:
-    bool lockInitialised_ = false;
     bool actionInstalled_ = false;
 };
 

@@ -1,0 +1,111 @@
+// The runtime's own counting semaphore, compatible with libquelta's.
+//
+// A runtime creates the semaphores it hands to quelta_iTSCEvent_Wait_C with
+// its own platform layer. The library then waits on them on the caller's
+// thread, and its timer thread posts them when a timeout expires, so both
+// sides must agree on the record and on the rules:
+//
+//  - the record is struct PalSemaphore from <quelta/PalSemaphore.h>:
+//    condition, mutex, count, waiters, in that order;
+//  - the condition variable measures time on CLOCK_MONOTONIC, and the mutex
+//    inherits priority (a real-time waiter boosts whoever holds it);
+//  - count and waiters change only with the mutex held;
+//  - a post is kept only while count <= waiters, so that count never exceeds
+//    waiters + 1: with nobody waiting, a semaphore remembers one post at
+//    most; a post signals one waiter when anybody waits;
+//  - a wait takes a pending post at once; otherwise it counts itself among
+//    the waiters and sleeps until a post is there or its timeout (in
+//    milliseconds; negative: none) has passed. A waiter that gives up drops
+//    a post that has become surplus. Results: 0 taken, 1 timed out, 2 failed.
+#ifndef QUELTA_EXAMPLES_RUNTIME_SEMAPHORE_H
+#define QUELTA_EXAMPLES_RUNTIME_SEMAPHORE_H
+
+#include <errno.h>
+#include <pthread.h>
+#include <stdint.h>
+#include <time.h>
+
+#include <quelta/PalSemaphore.h>
+
+namespace runtime {
+
+// Initialises a semaphore in place, with nothing pending and nobody waiting.
+// Returns 0 or the error of the failing initialisation.
+inline int SemaphoreInit(PalSemaphore* s) {
+    pthread_mutexattr_t mutexAttr;
+    pthread_mutexattr_init(&mutexAttr);
+    int rc = pthread_mutexattr_setprotocol(&mutexAttr, PTHREAD_PRIO_INHERIT);
+    if (rc == 0) rc = pthread_mutex_init(&s->mutex, &mutexAttr);
+    pthread_mutexattr_destroy(&mutexAttr);
+    if (rc != 0) return rc;
+
+    pthread_condattr_t condAttr;
+    pthread_condattr_init(&condAttr);
+    rc = pthread_condattr_setclock(&condAttr, CLOCK_MONOTONIC);
+    if (rc == 0) rc = pthread_cond_init(&s->condition, &condAttr);
+    pthread_condattr_destroy(&condAttr);
+    if (rc != 0) {
+        pthread_mutex_destroy(&s->mutex);
+        return rc;
+    }
+    s->count = 0;
+    s->waiters = 0;
+    return 0;
+}
+
+// Only when no thread waits on it any longer, and no pending library wait
+// can post it.
+inline int SemaphoreDestroy(PalSemaphore* s) {
+    const int c = pthread_cond_destroy(&s->condition);
+    const int m = pthread_mutex_destroy(&s->mutex);
+    return c != 0 ? c : m;
+}
+
+inline int SemaphorePost(PalSemaphore* s) {
+    pthread_mutex_lock(&s->mutex);
+    if (s->count <= s->waiters) ++s->count;  // else dropped: count <= waiters + 1
+    int rc = 0;
+    if (s->waiters >= 1) rc = pthread_cond_signal(&s->condition);
+    pthread_mutex_unlock(&s->mutex);
+    return rc;
+}
+
+inline uint32_t SemaphoreWait(PalSemaphore* s, int32_t timeoutMs) {
+    pthread_mutex_lock(&s->mutex);
+    if (s->count != 0) {
+        --s->count;
+        pthread_mutex_unlock(&s->mutex);
+        return 0;
+    }
+    ++s->waiters;
+    int rc = 0;
+    if (timeoutMs < 0) {
+        while (rc == 0 && s->count == 0) rc = pthread_cond_wait(&s->condition, &s->mutex);
+    } else {
+        timespec deadline;
+        clock_gettime(CLOCK_MONOTONIC, &deadline);
+        deadline.tv_sec += timeoutMs / 1000;
+        deadline.tv_nsec += static_cast<long>(timeoutMs % 1000) * 1000000L;
+        if (deadline.tv_nsec >= 1000000000L) {
+            deadline.tv_sec += 1;
+            deadline.tv_nsec -= 1000000000L;
+        }
+        while (rc == 0 && s->count == 0) {
+            rc = pthread_cond_timedwait(&s->condition, &s->mutex, &deadline);
+        }
+    }
+    --s->waiters;
+    uint32_t result = 0;
+    if (rc == 0) {
+        --s->count;
+    } else {
+        if (s->count - s->waiters > 1) --s->count;  // this waiter left: trim
+        result = rc == ETIMEDOUT ? 1 : 2;
+    }
+    pthread_mutex_unlock(&s->mutex);
+    return result;
+}
+
+}  // namespace runtime
+
+#endif

@@ -1,0 +1,55 @@
+// Summary statistics of a latency series and the verdict that compares a
+// series with the machine's own limit (the baseline series).
+#ifndef QUELTA_TOOLS_STATS_H
+#define QUELTA_TOOLS_STATS_H
+
+#include <cstddef>
+#include <string>
+#include <vector>
+
+namespace qtools {
+
+// Percentiles use the nearest-rank rule: the p-th percentile of n sorted
+// values is the value at rank ceil(p/100 * n) (1-based), so it is always one
+// of the samples. Fields are NaN for an empty series.
+struct Summary {
+    std::size_t count = 0;
+    std::size_t early = 0;  // values below zero (a wait that returned early)
+    double min;
+    double p50;
+    double p90;
+    double p99;
+    double p999;
+    double max;
+    Summary();
+};
+
+// Nearest-rank percentile of values sorted ascending; fraction in [0, 1]
+// (0.99 for p99). NaN for an empty vector.
+double PercentileOfSorted(const std::vector<double>& sorted, double fraction);
+
+// Sorts a copy of the values and summarises them.
+Summary Summarize(std::vector<double> values);
+
+// p99 of a series over p99 of the baseline; NaN when either is missing or
+// the baseline's p99 is not above zero.
+double RatioP99(const Summary& series, const Summary& baseline);
+
+// Differences of p99 below this many microseconds count as equal: on a
+// machine with a tiny baseline, ratios alone would call noise a difference.
+constexpr double kVerdictSlackUs = 5.0;
+
+// One line that tells a person how the series compares with the machine:
+//   "as good as the machine"              p99 within 1.1x (or within the slack)
+//   "within 1.5x of the machine"          p99 within 1.5x
+//   "within 2x of the machine"            p99 within 2x
+//   "worse than the machine: ..."         beyond, with the factor and the excess
+// An early return overrides all of these with a failure. Appended: a p50
+// more than 1.5x (and the slack) above the baseline's ("typical wake-up
+// +N us"), and failed calls. The baseline itself is "the machine's own limit".
+std::string VerdictFor(const Summary& series, const Summary& baseline, bool isBaseline,
+                       std::size_t failedCalls = 0);
+
+}  // namespace qtools
+
+#endif
