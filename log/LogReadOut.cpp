@@ -94,8 +94,7 @@ void tKPLogEngine::ReadOutMerged(uint32_t& count, uint32_t timeLow[], uint32_t t
             uint32_t pos = record.readPos.load(kRelaxed);
             if (pos >= ring.capacity) pos = ring.capacity - 1;
             const LogEntry& entry = ring.entries[pos];
-            const uint64_t time = (static_cast<uint64_t>(entry.timeHigh.load(kRelaxed)) << 32) |
-                                  entry.timeLow.load(kRelaxed);
+            const uint64_t time = entry.time.load(kRelaxed);
             if (!Earlier(bestTime, time)) continue;
             bestTime = time;
             best = i;

@@ -25,9 +25,12 @@ constexpr uint32_t kLogMaxRingEntries = 1u << 28;
 // The data word of the entries made by the plain recording operations.
 constexpr uint32_t kLogNoData = 0xFFFFFFFFu;
 
-struct LogEntry {
-    std::atomic<uint32_t> timeLow;   // ClockTime, low word first
-    std::atomic<uint32_t> timeHigh;
+// The time stamp is one 64-bit word (a ClockTime's two words, low first on
+// these little-endian targets) stored in one piece, so that two recorders
+// racing for a slot can mix words of their entries but never the halves of
+// a time: a torn stamp would put an entry seconds away from its neighbours.
+struct alignas(8) LogEntry {
+    std::atomic<uint64_t> time;
     std::atomic<uint32_t> event;
     std::atomic<uint32_t> data;
 };

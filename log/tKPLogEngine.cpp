@@ -157,8 +157,7 @@ void tKPLogEngine::Record(const ClockTime& time, uint32_t event, uint32_t data) 
     }
     record.writeIndex.store(slot + 1, kRelaxed);
     LogEntry& entry = ring.entries[slot];
-    entry.timeLow.store(time.low, kRelaxed);
-    entry.timeHigh.store(time.high, kRelaxed);
+    entry.time.store((static_cast<uint64_t>(time.high) << 32) | time.low, kRelaxed);
     entry.event.store(event, kRelaxed);
     entry.data.store(data, kRelaxed);
 }
