@@ -55,6 +55,20 @@ inline void Increment(ClockTime& value) {
 
 }  // namespace
 
+ClockTime NextMultiple(const ClockTime& now, uint32_t period) {
+    ClockTime multiple;
+    if (now.high == 0) {
+        multiple = ClockTime{now.low / period, 0};  // one 32-bit division
+    } else {
+        multiple = now;
+        ClockTime remainder{period, 0};
+        U64DivMod(multiple, remainder);
+    }
+    Increment(multiple);
+    U64MulU32(multiple, period);
+    return multiple;
+}
+
 void SleepUntilClocks(ClockTime deadline) {
     const timespec request = SplitClocks(deadline);
     // A signal handler interrupting the sleep must not shorten it: the same
@@ -128,19 +142,7 @@ extern "C" QUELTA_EXPORT uint32_t quelta_iTSC_WaitClocks_C(uint32_t duration) {
 
 extern "C" QUELTA_EXPORT uint32_t quelta_iTSC_WaitUntilNextMultipleClocks_C(uint32_t period) {
     if (period == 0) return quelta::ReadNow().low;
-
-    const ClockTime now = quelta::ReadNow();
-    ClockTime multiple;
-    if (now.high == 0) {
-        multiple = ClockTime{now.low / period, 0};
-    } else {
-        multiple = now;
-        ClockTime remainder{period, 0};
-        quelta::U64DivMod(multiple, remainder);
-    }
-    quelta::Increment(multiple);
-    quelta::U64MulU32(multiple, period);
     // Always strictly later than now: no comparison needed before sleeping.
-    quelta::SleepUntilClocks(multiple);
+    quelta::SleepUntilClocks(quelta::NextMultiple(quelta::ReadNow(), period));
     return quelta::ReadNow().low;
 }

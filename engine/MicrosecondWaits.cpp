@@ -88,17 +88,7 @@ extern "C" QUELTA_EXPORT uint32_t quelta_iTSC_WaitUntilMicroSeconds_C(uint32_t t
 extern "C" QUELTA_EXPORT uint32_t quelta_iTSC_WaitUntilNextMultipleMicroSeconds_C(uint32_t period) {
     if (period == 0) return quelta::NowMicroseconds().low;
 
-    const ClockTime now = quelta::NowMicroseconds();
-    ClockTime multiple;
-    if (now.high == 0) {
-        multiple = ClockTime{now.low / period, 0};
-    } else {
-        multiple = now;
-        ClockTime remainder{period, 0};
-        quelta::U64DivMod(multiple, remainder);
-    }
-    if (++multiple.low == 0) ++multiple.high;
-    quelta::U64MulU32(multiple, period);
+    const ClockTime multiple = quelta::NextMultiple(quelta::NowMicroseconds(), period);
     quelta::SleepUntilClocks(quelta::MicrosecondsToClocks(multiple));
     return quelta::NowMicroseconds().low;
 }
