@@ -89,6 +89,12 @@ std::string ReportToJson(const ProbeReport& r) {
         w.Key("verdict").String(s.verdict);
         w.Key("early").Unsigned(m.early);
         w.Key("failed").Unsigned(s.failed);
+        w.Key("over_1ms").Unsigned(s.overMs);
+        if (s.cpuHeld >= 0) {
+            w.Key("over_1ms_cpu_held").Integer(s.cpuHeld);
+        } else {
+            w.Key("over_1ms_cpu_held").Null();
+        }
         w.EndObject();
     }
     w.EndArray();

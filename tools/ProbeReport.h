@@ -28,6 +28,8 @@ struct SeriesResult {
     std::string description;
     Summary summary;           // microseconds
     std::size_t failed = 0;    // calls that did not return as documented (no sample)
+    std::size_t overMs = 0;    // samples more than 1 ms late
+    long cpuHeld = -1;         // of those, kept off the CPU for most of it; -1 unknown
     double ratio = 0.0;        // filled by FinishVerdicts (NaN when none)
     std::string verdict;       // filled by FinishVerdicts
 };

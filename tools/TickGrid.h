@@ -9,9 +9,11 @@
 // A stretch of the grid that starts at the first tick has an unknown phase;
 // it is placed so that the stretch's best tick is exactly `floorUs` late
 // (the probe passes the machine's best wake-up, the baseline's minimum).
-// Stretches that start at a restart are anchored on the late tick itself
-// (the callback runs a little after the pass that restarted the grid, so
-// such a stretch is lifted if it would show a tick before its grid).
+// Stretches that start at a restart are anchored on the late tick itself;
+// as the callback runs a little after the pass that restarted the grid, a
+// long stretch (100 ticks or more) is moved later, if need be, until its best
+// tick other than the first is `floorUs` late as well. No stretch is left
+// showing a tick before its grid.
 #ifndef QUELTA_TOOLS_TICKGRID_H
 #define QUELTA_TOOLS_TICKGRID_H
 

@@ -9,6 +9,7 @@
 #include <cstdlib>
 #include <string>
 
+#include "TestSupport.h"
 #include "probe_json_reader.h"
 
 using probejson::Value;
@@ -56,7 +57,14 @@ protected:
 TEST_F(ProbeCli, ShortSurveyWritesEveryOutput) {
     const std::string json = dir_ + "/p.json", svg = dir_ + "/p.svg", trace = dir_ + "/t.json";
     const ProbeRun r = Probe("--duration 2 --json " + json + " --svg " + svg + " --trace " + trace);
-    ASSERT_EQ(r.status, 0) << r.output;
+    // Without real-time privilege the library's timer thread does not serve,
+    // and its event waits return at once: the probe reports that (status 3).
+    const bool realtime = testsupport::CanUseRealtime();
+    if (realtime) {
+        ASSERT_EQ(r.status, 0) << r.output;
+    } else {
+        ASSERT_TRUE(r.status == 0 || r.status == 3) << r.output;
+    }
     EXPECT_NE(r.output.find("baseline"), std::string::npos) << r.output;
     EXPECT_NE(r.output.find("ns/call"), std::string::npos) << r.output;
     EXPECT_EQ(r.output.find('\r'), std::string::npos);  // no progress line without a terminal
@@ -73,6 +81,7 @@ TEST_F(ProbeCli, ShortSurveyWritesEveryOutput) {
     for (std::size_t i = 0; i < 7; ++i) {
         const Value& s = doc["series"][i];
         EXPECT_EQ(s["name"].s, names[i]);
+        if (!realtime) continue;
         EXPECT_GT(s["count"].n, 10) << names[i];
         EXPECT_EQ(s["early"].n, 0) << names[i];
         EXPECT_EQ(s["failed"].n, 0) << names[i];
@@ -91,7 +100,9 @@ TEST_F(ProbeCli, ShortSurveyWritesEveryOutput) {
         ticks += e["ph"].s == "i" && e["name"].s == "tick";
     }
     EXPECT_GT(spans, 60);  // every sample a span
-    EXPECT_GT(ticks, 100);
+    if (realtime) {
+        EXPECT_GT(ticks, 100);
+    }
     EXPECT_EQ(tracks, static_cast<int>(doc["machine"]["cpus"].n));
 
     const std::string svgText = probejson::ReadFile(svg);

@@ -61,9 +61,19 @@ qtools::ProbeReport SampleReport() {
     r.machine.priority = 98;
     r.library = "/opt/lib/libquelta.so.6";
     r.durationS = 10.0;
-    qtools::SeriesResult base{"baseline", "raw sleep", qtools::Summarize({10, 20, 30, 40}), 0, 0, ""};
-    qtools::SeriesResult wait{"plain-wait", "wait", qtools::Summarize({15, 25, 35, 55}), 0, 0, ""};
-    qtools::SeriesResult empty{"event-own-sem", "event", qtools::Summarize({}), 7, 0, ""};
+    auto series = [](const char* name, std::vector<double> v, std::size_t failed, long held) {
+        qtools::SeriesResult s;
+        s.name = name;
+        s.description = std::string("about ") + name;
+        s.summary = qtools::Summarize(v);
+        s.failed = failed;
+        s.cpuHeld = held;
+        return s;
+    };
+    const qtools::SeriesResult base = series("baseline", {10, 20, 30, 40}, 0, 0);
+    qtools::SeriesResult wait = series("plain-wait", {15, 25, 35, 55, 1500, 2500}, 0, 1);
+    wait.overMs = 2;
+    const qtools::SeriesResult empty = series("event-own-sem", {}, 7, -1);
     r.series = {base, wait, empty};
     r.costs.push_back({"clock_gettime_monotonic", "clock_gettime(CLOCK_MONOTONIC)", -1, 20.5, -1.0});
     r.costs.push_back({"read_monotonic0", "engine ReadMonotonic0 (slot 0)", 0, 22.34, 20.5});
@@ -97,15 +107,18 @@ TEST(ProbeJson, ReportFollowsTheSchema) {
     }
     EXPECT_EQ(series[0]["name"].s, "baseline");
     EXPECT_EQ(series[0]["ratio_p99_to_baseline"].n, 1.0);
-    EXPECT_EQ(series[1]["p99"].n, 55);
+    EXPECT_EQ(series[1]["p50"].n, 35);
     EXPECT_EQ(series[1]["min"].n, 15);
-    EXPECT_DOUBLE_EQ(series[1]["ratio_p99_to_baseline"].n, 55.0 / 40.0);
-    EXPECT_EQ(series[1]["verdict"].s, "within 1.5x of the machine");
+    EXPECT_EQ(series[1]["max"].n, 2500);
+    EXPECT_DOUBLE_EQ(series[1]["ratio_p99_to_baseline"].n, 2500.0 / 40.0);
+    EXPECT_EQ(series[1]["over_1ms"].n, 2);
+    EXPECT_EQ(series[1]["over_1ms_cpu_held"].n, 1);
     // An empty series: count 0, no numbers, its failures counted.
     EXPECT_EQ(series[2]["count"].n, 0);
     EXPECT_EQ(series[2]["p99"].kind, Value::Null);
     EXPECT_EQ(series[2]["ratio_p99_to_baseline"].kind, Value::Null);
     EXPECT_EQ(series[2]["failed"].n, 7);
+    EXPECT_EQ(series[2]["over_1ms_cpu_held"].kind, Value::Null);  // not known
 
     const Value& costs = v["costs"];
     ASSERT_EQ(costs.items.size(), 2u);
@@ -122,8 +135,8 @@ TEST(ProbeJson, TablesShowEverySeriesWithOneDecimal) {
     const qtools::ProbeReport report = SampleReport();
     const std::string t = qtools::FormatSeriesTable(report);
     for (const char* name : {"baseline", "plain-wait", "event-own-sem"}) EXPECT_NE(t.find(name), std::string::npos);
-    EXPECT_NE(t.find("55.0"), std::string::npos);
-    EXPECT_NE(t.find("1.38x"), std::string::npos);
+    EXPECT_NE(t.find("2500.0"), std::string::npos);
+    EXPECT_NE(t.find("62.50x"), std::string::npos);
     EXPECT_NE(t.find("no samples; 7 calls failed"), std::string::npos);
     const std::string c = qtools::FormatCostTable(report);
     EXPECT_NE(c.find("22.3"), std::string::npos);

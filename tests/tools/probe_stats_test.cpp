@@ -160,6 +160,22 @@ TEST(ProbeTickGrid, FollowsTheRestartAfterAMissedTick) {
     for (std::size_t k = 0; k < late.size(); ++k) EXPECT_NEAR(r.latenessUs[k], run.lateUs[k], 1e-6) << k;
 }
 
+TEST(ProbeTickGrid, PlacesALongStretchAfterARestartByTheFloorToo) {
+    // The late tick's callback ran 20 us after its pass, so the restarted
+    // grid looks 20 us later than it is; the stretch's best tick is at the
+    // floor (30 us) like the first stretch's.
+    std::vector<int64_t> late(400, 60000);
+    late[0] = 30000;
+    late[50] = 2500000;
+    late[51] = 3000;
+    late[300] = 30000;
+    TickRun run = Simulate(late);
+    run.times[50] += 20000;
+    const auto r = qtools::TickLateness(run.times, 1000000, 30.0);
+    EXPECT_EQ(r.restarts, 1u);
+    for (std::size_t k = 51; k < late.size(); ++k) EXPECT_NEAR(r.latenessUs[k], run.lateUs[k], 1e-6) << k;
+}
+
 TEST(ProbeTickGrid, NeverShowsATickEarlyAndHandlesNoTicks) {
     EXPECT_TRUE(qtools::TickLateness({}, 1000000, 10.0).latenessUs.empty());
     // Irregular ticks whose grid cannot be fitted exactly: still no negative.

@@ -89,7 +89,11 @@ int main(int argc, char** argv) {
         case ParseOutcome::Run:
             break;
     }
-    const std::string library = options.library.empty() ? QUELTA_DEFAULT_SO : options.library;
+    // The library built beside this probe when it is still there; otherwise
+    // (an installed probe) the system's libquelta.so.6, found as a runtime
+    // finds it.
+    std::string library = options.library;
+    if (library.empty()) library = access(QUELTA_DEFAULT_SO, R_OK) == 0 ? QUELTA_DEFAULT_SO : "libquelta.so.6";
 
     const std::pair<const std::string*, const char*> outputs[] = {
         {&options.jsonPath, "--json"}, {&options.svgPath, "--svg"}, {&options.tracePath, "--trace"}};
@@ -128,6 +132,8 @@ int main(int argc, char** argv) {
         r.description = SeriesDescription(s.id);
         r.summary = qtools::Summarize(s.latenessUs);
         r.failed = s.failed;
+        r.overMs = s.overMs;
+        r.cpuHeld = s.cpuHeld;
         report.series.push_back(r);
         plot.push_back(qtools::PlotSeries{r.name, s.latenessUs});
     }

@@ -2,6 +2,7 @@
 
 #include <dirent.h>
 #include <errno.h>
+#include <fcntl.h>
 #include <pthread.h>
 #include <sched.h>
 #include <sys/mman.h>
@@ -29,7 +30,7 @@ constexpr int64_t kMinDelayNs = 200000;     // deadlines 0.2 ms ...
 constexpr int64_t kDelaySpreadNs = 1000000;  // ... to 1.2 ms ahead
 constexpr int kWarmUpRounds = 20;
 constexpr uint64_t kTickPeriodNs = 1000000;
-constexpr int32_t kCallbackTimeoutMs = 1000;
+constexpr int32_t kCallbackTimeoutMs = 250;
 
 const uint32_t kSampledSeries[] = {kBaseline, kEventOwnSem, kPlainWait, kEventTimeout, kGlobalWait,
                                    kCallbackTime};
@@ -38,6 +39,19 @@ int64_t MonoNs() {
     timespec t{};
     clock_gettime(CLOCK_MONOTONIC, &t);
     return static_cast<int64_t>(t.tv_sec) * 1000000000LL + t.tv_nsec;
+}
+
+// Time this thread has spent runnable but not running, in ns (the kernel's
+// run delay), or -1 when the kernel does not keep it.
+int64_t RunDelayNs(int fd) {
+    if (fd < 0) return -1;
+    char buf[96];
+    const ssize_t n = pread(fd, buf, sizeof buf - 1, 0);
+    if (n <= 0) return -1;
+    buf[n] = '\0';
+    unsigned long long onCpu = 0, waiting = 0;
+    if (std::sscanf(buf, "%llu %llu", &onCpu, &waiting) != 2) return -1;
+    return static_cast<int64_t>(waiting);
 }
 
 uint64_t U64(const ClockTime& t) { return (static_cast<uint64_t>(t.high) << 32) | t.low; }
@@ -99,6 +113,7 @@ struct Worker {
     CallbackState callback;
     std::mt19937_64 rng;
     std::size_t strayPosts = 0;
+    int schedstatFd = -1;  // this thread's /proc schedstat, for its run delay
     uint32_t unexpectedResult[kSeriesCount] = {};
 
     // One sample; false when the call did not work as documented.
@@ -240,6 +255,8 @@ void Worker::Run() {
     ticks.times.assign(static_cast<std::size_t>(config.durationS) * 1050 + 2000, 0);
     ticks.log = log;
     std::vector<std::size_t> failed(kSeriesCount, 0);
+    std::vector<std::size_t> overMs(kSeriesCount, 0), cpuHeld(kSeriesCount, 0);
+    schedstatFd = open("/proc/thread-self/schedstat", O_RDONLY | O_CLOEXEC);
 
     if (out.realtime) {
         out.memoryLocked = mlockall(MCL_CURRENT | MCL_FUTURE) == 0;
@@ -265,20 +282,36 @@ void Worker::Run() {
 
     uint32_t order[std::size(kSampledSeries)];
     std::copy(std::begin(kSampledSeries), std::end(kSampledSeries), order);
+    // A series whose calls keep failing is dropped, so that one that fails
+    // slowly (a callback that never comes) does not starve the others.
+    constexpr std::size_t kGiveUpAfter = 3;
+    std::vector<std::size_t> failedInARow(kSeriesCount, 0);
     auto usable = [&](uint32_t id) {
         if (id == kEventTimeout && timeoutSemaphore == nullptr) return false;
         if (id == kCallbackTime && callback.semaphore == nullptr) return false;
-        return true;
+        return failedInARow[id] < kGiveUpAfter;
+    };
+
+    // One sample of a series; counts a failure, and drops a series after a
+    // few failures in a row, warm-up included.
+    auto attempt = [&](uint32_t id, double& lateness) {
+        const bool ok = Sample(id, delay(), lateness);
+        failedInARow[id] = ok ? 0 : failedInARow[id] + 1;
+        if (!ok) ++failed[id];
+        if (failedInARow[id] == kGiveUpAfter) {
+            out.notes.push_back(std::string(SeriesName(id)) + ": dropped from the survey after " +
+                                std::to_string(kGiveUpAfter) + " failed calls in a row");
+        }
+        return ok;
     };
 
     // Warm-up: code and data paths in, nothing recorded.
     for (int r = 0; r < kWarmUpRounds; ++r) {
         for (uint32_t id : order) {
             double ignored;
-            if (usable(id)) Sample(id, delay(), ignored);
+            if (usable(id)) attempt(id, ignored);
         }
     }
-    for (uint32_t& r : unexpectedResult) r = 0;
 
     // The survey.
     log->SetEnabled(1);
@@ -297,11 +330,20 @@ void Worker::Run() {
         for (uint32_t id : order) {
             if (!usable(id)) continue;
             double lateness = 0.0;
-            if (Sample(id, delay(), lateness)) {
+            const int64_t delayBefore = RunDelayNs(schedstatFd);
+            const bool ok = attempt(id, lateness);
+            const int64_t delayAfter = RunDelayNs(schedstatFd);
+            if (ok) {
                 samples[id].push_back(static_cast<float>(lateness));
                 if (samples[id].size() >= rounds) full = true;
-            } else {
-                ++failed[id];
+                if (lateness > 1000.0) {
+                    ++overMs[id];
+                    // Kept off the CPU for at least half of the lateness.
+                    if (delayBefore >= 0 && delayAfter >= 0 &&
+                        static_cast<double>(delayAfter - delayBefore) / 1000.0 >= lateness / 2) {
+                        ++cpuHeld[id];
+                    }
+                }
             }
         }
         progress.samples.fetch_add(std::size(kSampledSeries), std::memory_order_relaxed);
@@ -349,15 +391,19 @@ void Worker::Run() {
         s.failed = failed[id];
         if (id == kTick) {
             s.latenessUs = tick.latenessUs;
+            s.overMs = static_cast<std::size_t>(
+                std::count_if(s.latenessUs.begin(), s.latenessUs.end(), [](double v) { return v > 1000.0; }));
         } else {
             s.latenessUs.assign(samples[id].begin(), samples[id].end());
             std::vector<float>().swap(samples[id]);
+            s.overMs = overMs[id];
+            if (schedstatFd >= 0) s.cpuHeld = static_cast<long>(cpuHeld[id]);
         }
         out.series.push_back(std::move(s));
         if (unexpectedResult[id] != 0) {
             const uint32_t r = unexpectedResult[id];
             std::string what = r == 100   ? "returned 0 (no timer)"
-                               : r == 101 ? "never called back within 1 s"
+                               : r == 101 ? "never called back within 250 ms"
                                           : "returned " + std::to_string(r);
             out.notes.push_back(std::string(SeriesName(id)) + ": " + std::to_string(failed[id]) +
                                 " call(s) failed; the last " + what);
@@ -367,6 +413,17 @@ void Worker::Run() {
         out.notes.push_back("tick: the tick grid restarted " + std::to_string(tick.restarts) +
                             " time(s) (a tick served more than 1 ms late)");
     }
+    std::size_t over = 0, held = 0;
+    for (uint32_t id : kSampledSeries) {
+        over += overMs[id];
+        held += cpuHeld[id];
+    }
+    if (over > 0 && schedstatFd >= 0) {
+        out.notes.push_back(std::to_string(over) + " wait(s) woke more than 1 ms late; in " + std::to_string(held) +
+                            " of them the survey thread was runnable but kept off its CPU for at least half of "
+                            "the lateness (other work on the machine, not the wait itself)");
+    }
+    if (schedstatFd >= 0) close(schedstatFd);
     if (strayPosts > 0) {
         out.notes.push_back("event-timeout: " + std::to_string(strayPosts) +
                             " wait(s) left a post on the semaphore (the timeout's post was not taken)");
@@ -488,7 +545,10 @@ SurveyResult RunSurvey(const LoadedQuelta& lib, const SurveyConfig& config) {
     worker.result = &result;
 
     int timerPolicy = 0, timerPriority = 0;
-    if (TimerThreadPolicy(timerPolicy, timerPriority) && timerPolicy != SCHED_FIFO) {
+    if (!TimerThreadPolicy(timerPolicy, timerPriority)) {
+        result.notes.push_back("the library's timer thread QUELTAisr is not running (it needs SCHED_FIFO): "
+                               "nothing serves the tick, the callbacks or the event and global-clock waits");
+    } else if (timerPolicy != SCHED_FIFO) {
         result.notes.push_back("the library's timer thread QUELTAisr does not run under SCHED_FIFO");
     }
 

@@ -47,6 +47,10 @@ struct SeriesSamples {
     uint32_t id = 0;
     std::vector<double> latenessUs;
     std::size_t failed = 0;
+    // Wake-ups more than 1 ms late, and how many of them the survey thread
+    // spent mostly runnable but off its CPU (-1: not known for this series).
+    std::size_t overMs = 0;
+    long cpuHeld = -1;
 };
 
 struct LogSnapshot {
