@@ -3,6 +3,8 @@
 // With the tick service in use they take a wait node, queue it in deadline
 // order and let the timer thread fire it; without it they fall back to plain
 // sleeps and semaphore waits with millisecond timeouts.
+#include <time.h>
+
 #include <cstdint>
 
 #include "engine/ClockTimeOps.h"
@@ -38,14 +40,43 @@ public:
 
 iKPusTimingEngine* Engine() { return gEngine.load(std::memory_order_acquire); }
 
-// Blocks on a node's own semaphore until the tick service has fired the node.
-// Only the firing posts it, so a post means the deadline has come; the stop
-// posts it too, and then the wait ends without the node having fired.
-void WaitUntilFired(WaitNode* node) {
+// The monotonic deadline as a semaphore-wait bound. False when there is no
+// usable bound (more than 68 years ahead: wait for the node alone); a time
+// before 0 in the library's order has passed and gives {0, 0}.
+bool WaitBound(uint64_t monotonic, timespec& out) {
+    out = timespec{0, 0};
+    if (static_cast<uint32_t>(monotonic >> 32) == 0xFFFFFFFFu) return true;
+    const uint64_t seconds = monotonic / 1000000000u;
+    if (seconds > 0x7FFFFFFFu) return false;
+    out.tv_sec = static_cast<time_t>(seconds);
+    out.tv_nsec = static_cast<long>(monotonic - seconds * 1000000000u);
+    return true;
+}
+
+// Blocks on a node's own semaphore until its deadline. Two things end the
+// wait: the tick service firing the node (which posts the semaphore), or the
+// waiter's own timed wait reaching the deadline. The second needs no second
+// thread to wake the waiter, so a wait ends one scheduler wake-up after its
+// deadline instead of two. A global-clock deadline is converted afresh on
+// every round and checked against the global clock itself, so a step of the
+// wall clock moves it. The stop posts the semaphore too; the wait then ends.
+void WaitUntilDue(iKPusTimingEngine* engine, WaitNode* node, const ClockTime& deadline, bool global) {
     PalSemaphore* semaphore = node->semaphore.load(kRelaxed);
     while (node->fireCount.load(std::memory_order_acquire) == 0) {
         if (gStopping.load(std::memory_order_acquire)) return;
-        if (PalSemaphoreWait(semaphore, -1) == 2) PalSleepMilliseconds(1);
+        const uint64_t monotonic = global ? ToU64(engine->GlobalToMonotonicFwd(deadline)) : ToU64(deadline);
+        timespec bound;
+        const bool bounded = WaitBound(monotonic, bound);
+        const uint32_t r = PalSemaphoreWaitUntil(semaphore, bounded ? &bound : nullptr);
+        if (r == 1) {
+            if (!global) return;  // the monotonic deadline has come
+            ClockTime now;
+            engine->ReadGlobal6(now);
+            if (!Earlier(now, deadline)) return;
+            // The wall clock was stepped back: wait on for the new instant.
+        } else if (r == 2) {
+            PalSleepMilliseconds(1);
+        }
     }
 }
 
@@ -113,7 +144,7 @@ extern "C" QUELTA_EXPORT void quelta_iTSC_WaitUntilGlobalClocks64_C(const ClockT
         node->autoRelease.store(0, kRelaxed);
         node->isGlobal.store(1, kRelaxed);
         const ClockTime copy = *target;
-        if (InsertWaitNode(node, &copy, nullptr, nullptr) == 0) WaitUntilFired(node);
+        if (InsertWaitNode(node, &copy, nullptr, nullptr) == 0) WaitUntilDue(engine, node, copy, true);
         if (abortFlag != nullptr && generation != gGeneration.load(kRelaxed)) *abortFlag = 1;
         ReleaseWaitNode(node);
     }
@@ -155,7 +186,7 @@ extern "C" QUELTA_EXPORT uint32_t quelta_iTSCEvent_Wait_Callback_C(PalSemaphore*
     const ClockTime copy = *deadline;
     const uint32_t r = InsertWaitNode(node, &copy, callback, callbackArg);
     if (!ownSemaphore) return r;
-    if (r == 0) WaitUntilFired(node);
+    if (r == 0) WaitUntilDue(engine, node, copy, isGlobal != 0);
     ReleaseWaitNode(node);
     return r;
 }
@@ -183,7 +214,17 @@ extern "C" QUELTA_EXPORT uint32_t quelta_iTSCEvent_Wait_C(PalSemaphore* semaphor
         ReleaseWaitNode(node);
         return 1;
     }
-    const uint32_t waited = PalSemaphoreWait(semaphore, -1);
+    // Bounded by the deadline itself, so the timeout ends with this thread's
+    // own wake-up; the node, fired at the same deadline, is then cancelled.
+    timespec bound;
+    const bool bounded = WaitBound(ToU64(deadline), bound);
+    const uint32_t waited = PalSemaphoreWaitUntil(semaphore, bounded ? &bound : nullptr);
+    if (waited == 1) {
+        // If the node fired meanwhile, its post is on the semaphore: take it
+        // back, so the semaphore's count is as it was before the call.
+        if (ReleaseWaitNodeReport(node) != 0) PalSemaphoreWait(semaphore, 0);
+        return 1;
+    }
     const uint32_t result = node->fireCount.load(std::memory_order_acquire) != 0 ? 1 : waited;
     ReleaseWaitNode(node);
     return result;

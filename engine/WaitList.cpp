@@ -154,12 +154,19 @@ bool IsPoolNode(const WaitNode* node) {
 
 WaitNode* TakeFreeNode() {
     if (gEventSystemReady.load(kRelaxed) == 0) return nullptr;
-    SchedLockGuard lock;
-    WaitNode* node = gFreeList.load(kRelaxed);
-    if (node == nullptr) return nullptr;
-    gFreeList.store(node->next.load(kRelaxed), kRelaxed);
-    node->state.store(static_cast<uint32_t>(NodeState::kHeld), kRelaxed);
-    node->releasePending.store(0, kRelaxed);
+    WaitNode* node;
+    {
+        SchedLockGuard lock;
+        node = gFreeList.load(kRelaxed);
+        if (node == nullptr) return nullptr;
+        gFreeList.store(node->next.load(kRelaxed), kRelaxed);
+        node->state.store(static_cast<uint32_t>(NodeState::kHeld), kRelaxed);
+        node->releasePending.store(0, kRelaxed);
+    }
+    // A waiter that ended at its own deadline may have left the node's firing
+    // post behind on its own semaphore: every use starts with it empty.
+    PalSemaphore* own = node->ownSemaphore.load(kRelaxed);
+    if (own != nullptr) PalSemaphoreWait(own, 0);
     return node;
 }
 
@@ -194,14 +201,16 @@ uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
     return queued ? 0 : 1;
 }
 
-void ReleaseWaitNode(WaitNode* node) {
-    if (gEventSystemReady.load(kRelaxed) == 0 || node == nullptr) return;
+void ReleaseWaitNode(WaitNode* node) { (void)ReleaseWaitNodeReport(node); }
+
+uint32_t ReleaseWaitNodeReport(WaitNode* node) {
+    if (gEventSystemReady.load(kRelaxed) == 0 || node == nullptr) return 0;
     if (!IsPoolNode(node)) {
         PAL_DEBUG_PRINT("ReleaseWaitNode: %p is not a wait node of this library; ignored",
                         static_cast<void*>(node));
-        return;
+        return 0;
     }
-    if (node->prev.load(kRelaxed) == NotQueuedMark()) return;  // never taken
+    if (node->prev.load(kRelaxed) == NotQueuedMark()) return 0;  // never taken
     for (uint32_t round = 0;; ++round) {
         {
             SchedLockGuard lock;
@@ -209,22 +218,22 @@ void ReleaseWaitNode(WaitNode* node) {
             if (state == NodeState::kFree) {
                 PAL_DEBUG_PRINT("ReleaseWaitNode: node %p released twice; ignored",
                                 static_cast<void*>(node));
-                return;
+                return 0;
             }
             if (state == NodeState::kQueued) {  // cancels the wait
                 UnlinkQueued(node);
                 PushFree(node);
-                return;
+                return 0;
             }
             if (state == NodeState::kHeld || state == NodeState::kFired) {
                 PushFree(node);  // a fired node is off the list already
-                return;
+                return state == NodeState::kFired ? 1 : 0;
             }
             // kFiring. From a callback on the timer thread the firing cannot
             // finish while we wait: let it free the node when it settles.
             if (OnTimerThread()) {
                 node->releasePending.store(1, kRelaxed);
-                return;
+                return 1;
             }
         }
         PauseForFiring(round);

@@ -100,6 +100,9 @@ WaitNode* TakeFreeNode();
 uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
                         QueltaWaitCallbackFn callback, void* callbackArg);
 void ReleaseWaitNode(WaitNode* node);
+// As ReleaseWaitNode; 1 when the node had fired (its semaphore was posted),
+// 0 when it was cancelled, never queued, or the release was refused.
+uint32_t ReleaseWaitNodeReport(WaitNode* node);
 void FireWaitNode(WaitNode* node);  // tick service only
 
 // Tick service helpers. Fires the head when its effective deadline is due at

@@ -60,6 +60,23 @@ int32_t PalSemaphoreCreate(PalSemaphore** out) {
 }
 
 uint32_t PalSemaphoreWait(PalSemaphore* semaphore, int32_t timeoutMs) {
+    if (timeoutMs < 0) return PalSemaphoreWaitUntil(semaphore, nullptr);
+    if (timeoutMs == 0) {
+        // Nothing to wait for: a timed wait on an already passed deadline
+        // would still sleep until the next timer interrupt (start-up drains
+        // 128 semaphores this way). Result and counters are the same.
+        if (semaphore == nullptr) return 2;
+        pthread_mutex_lock(&semaphore->mutex);
+        const bool taken = semaphore->count != 0;
+        if (taken) --semaphore->count;
+        pthread_mutex_unlock(&semaphore->mutex);
+        return taken ? 0 : 1;
+    }
+    const timespec deadline = MonotonicDeadline(timeoutMs);
+    return PalSemaphoreWaitUntil(semaphore, &deadline);
+}
+
+uint32_t PalSemaphoreWaitUntil(PalSemaphore* semaphore, const timespec* deadline) {
     if (semaphore == nullptr) return 2;
     pthread_mutex_lock(&semaphore->mutex);
     if (semaphore->count != 0) {
@@ -67,18 +84,10 @@ uint32_t PalSemaphoreWait(PalSemaphore* semaphore, int32_t timeoutMs) {
         pthread_mutex_unlock(&semaphore->mutex);
         return 0;
     }
-    if (timeoutMs == 0) {
-        // Nothing pending and no time to wait: a timed wait on an already
-        // passed deadline would still sleep until the next timer interrupt
-        // (start-up drains 128 semaphores this way). The result and the
-        // counters are the same as after such a wait.
-        pthread_mutex_unlock(&semaphore->mutex);
-        return 1;
-    }
 
     ++semaphore->waiters;
     int result = 0;
-    if (timeoutMs < 0) {
+    if (deadline == nullptr) {
         do {
             result = pthread_cond_wait(&semaphore->condition, &semaphore->mutex);
         } while (result == 0 && semaphore->count == 0);
@@ -86,9 +95,8 @@ uint32_t PalSemaphoreWait(PalSemaphore* semaphore, int32_t timeoutMs) {
         // The condition runs on CLOCK_MONOTONIC, so a step of the wall clock
         // neither shortens nor stretches the wait. Spurious wake-ups wait
         // again for the same deadline.
-        const timespec deadline = MonotonicDeadline(timeoutMs);
         do {
-            result = pthread_cond_timedwait(&semaphore->condition, &semaphore->mutex, &deadline);
+            result = pthread_cond_timedwait(&semaphore->condition, &semaphore->mutex, deadline);
         } while (result == 0 && semaphore->count == 0);
     }
 

@@ -6,6 +6,8 @@
 #ifndef QUELTA_TLINUX_PALSEMAPHOREOPS_H
 #define QUELTA_TLINUX_PALSEMAPHOREOPS_H
 
+#include <time.h>
+
 #include <cstdint>
 
 #include "quelta/PalSemaphore.h"
@@ -14,6 +16,10 @@ namespace quelta {
 
 int32_t PalSemaphoreCreate(PalSemaphore** out);
 uint32_t PalSemaphoreWait(PalSemaphore* semaphore, int32_t timeoutMs);
+// As PalSemaphoreWait, until an absolute CLOCK_MONOTONIC deadline (null:
+// none). The waiter's own kernel timer ends the wait, so a wait bounded by a
+// known deadline needs no second thread to wake it.
+uint32_t PalSemaphoreWaitUntil(PalSemaphore* semaphore, const timespec* deadline);
 int32_t PalSemaphorePost(PalSemaphore* semaphore);
 int32_t PalSemaphoreDestroy(PalSemaphore* semaphore);
 
