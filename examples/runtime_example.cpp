@@ -35,7 +35,9 @@
 
 #include <quelta/quelta.h>
 
-#include "runtime_semaphore.h"
+#include <quelta/RuntimeSemaphore.h>
+
+namespace runtime = quelta_runtime;
 
 namespace {
 

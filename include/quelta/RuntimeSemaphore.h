@@ -1,4 +1,6 @@
-// The runtime's own counting semaphore, compatible with libquelta's.
+// A runtime's own counting semaphore, compatible with libquelta's: a small
+// reference implementation, header only, for runtimes that have no platform
+// layer of their own yet.
 //
 // A runtime creates the semaphores it hands to quelta_iTSCEvent_Wait_C with
 // its own platform layer. The library then waits on them on the caller's
@@ -17,17 +19,19 @@
 //    the waiters and sleeps until a post is there or its timeout (in
 //    milliseconds; negative: none) has passed. A waiter that gives up drops
 //    a post that has become surplus. Results: 0 taken, 1 timed out, 2 failed.
-#ifndef QUELTA_EXAMPLES_RUNTIME_SEMAPHORE_H
-#define QUELTA_EXAMPLES_RUNTIME_SEMAPHORE_H
+#ifndef QUELTA_RUNTIMESEMAPHORE_H
+#define QUELTA_RUNTIMESEMAPHORE_H
 
 #include <errno.h>
 #include <pthread.h>
 #include <stdint.h>
 #include <time.h>
 
-#include <quelta/PalSemaphore.h>
+#include <stdlib.h>
 
-namespace runtime {
+#include "quelta/PalSemaphore.h"
+
+namespace quelta_runtime {
 
 // Initialises a semaphore in place, with nothing pending and nobody waiting.
 // Returns 0 or the error of the failing initialisation.
@@ -106,6 +110,37 @@ inline uint32_t SemaphoreWait(PalSemaphore* s, int32_t timeoutMs) {
     return result;
 }
 
-}  // namespace runtime
+// Posts not yet taken (read under the mutex).
+inline int32_t SemaphorePending(PalSemaphore* s) {
+    pthread_mutex_lock(&s->mutex);
+    const int32_t n = s->count;
+    pthread_mutex_unlock(&s->mutex);
+    return n;
+}
+
+// A semaphore on the heap: 0, or the error of the allocation (ENOMEM) or of
+// the initialisation (*out untouched then).
+inline int SemaphoreCreate(PalSemaphore** out) {
+    PalSemaphore* s = static_cast<PalSemaphore*>(malloc(sizeof(PalSemaphore)));
+    if (s == nullptr) return ENOMEM;
+    const int rc = SemaphoreInit(s);
+    if (rc != 0) {
+        free(s);
+        return rc;
+    }
+    *out = s;
+    return 0;
+}
+
+// Takes a pending post if there is one, destroys and frees; 22 for null.
+inline int SemaphoreDelete(PalSemaphore* s) {
+    if (s == nullptr) return EINVAL;
+    SemaphoreWait(s, 0);
+    const int rc = SemaphoreDestroy(s);
+    free(s);
+    return rc;
+}
+
+}  // namespace quelta_runtime
 
 #endif
