@@ -132,6 +132,7 @@ void InitWaitNodePool(WaitNode* pool, uint32_t count) {
         n.isGlobal.store(0, kRelaxed);
         n.next.store(i + 1 < count ? &pool[i + 1] : nullptr, kRelaxed);
         n.prev.store(NotQueuedMark(), kRelaxed);
+        n.ownSemaphore.store(nullptr, kRelaxed);  // start-up creates them next
         n.autoRelease.store(1, kRelaxed);
         n.abortable.store(0, kRelaxed);
         n.state.store(static_cast<uint32_t>(NodeState::kFree), kRelaxed);

@@ -4,7 +4,6 @@
 // and destruction is prompt and leaves nothing behind.
 #include <gtest/gtest.h>
 
-#include <pthread.h>
 #include <sched.h>
 #include <signal.h>
 #include <sys/syscall.h>
@@ -19,7 +18,6 @@
 #include <mutex>
 #include <string>
 #include <thread>
-#include <vector>
 
 #include "TestSupport.h"
 #include "nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.h"
@@ -31,35 +29,27 @@ namespace {
 using testsupport::MonoNowNs;
 using Timer = tKPusLinuxNanoSleepTimer;
 
-constexpr uint64_t kUs = 1000ull;
-constexpr uint64_t kMs = 1000000ull;
-constexpr uint64_t kLate = 50 * kMs;  // lateness bound: loose, the VM is noisy
+constexpr uint64_t kUs = 1000ull, kMs = 1000000ull;
+constexpr uint64_t kLate = 50 * kMs;    // lateness bound: loose, the VM is noisy
+constexpr uint64_t kFar = 10000 * kMs;  // a sleep to be cut short
 
-ClockTime Ct(uint64_t ns) {
-    return ClockTime{static_cast<uint32_t>(ns), static_cast<uint32_t>(ns >> 32)};
-}
-
+ClockTime Ct(uint64_t ns) { return ClockTime{static_cast<uint32_t>(ns), static_cast<uint32_t>(ns >> 32)}; }
 int32_t Tid() { return static_cast<int32_t>(syscall(SYS_gettid)); }
 
-bool WaitUntil(const std::function<bool()>& done, uint64_t timeoutNs) {
-    const uint64_t end = MonoNowNs() + timeoutNs;
-    while (!done()) {
+bool WaitUntil(const std::function<bool()>& done, uint64_t timeoutNs = 2000 * kMs) {
+    for (const uint64_t end = MonoNowNs() + timeoutNs; !done(); usleep(200)) {
         if (MonoNowNs() > end) return false;
-        usleep(200);
     }
     return true;
 }
 
-// --- callback recording -----------------------------------------------------
-
+// The callback runs on the timer thread (one timer fires at a time in these
+// tests). The time is stored before the count moves, so a reader that sees
+// the count also sees the time.
 constexpr int kMaxCalls = 1 << 16;
 std::atomic<int> gCalls{0};
 std::atomic<uint64_t> gCallTimes[kMaxCalls];
 std::atomic<void (*)()> gAfterCall{nullptr};  // a test's extra work in the callback
-
-// Runs on the timer thread (one timer fires at a time in these tests). The
-// time is stored before the count moves, so a reader that sees the count also
-// sees the time.
 void RecordCall() {
     const uint64_t now = MonoNowNs();
     const int i = gCalls.load();
@@ -67,39 +57,29 @@ void RecordCall() {
     gCalls.store(i + 1);
     if (void (*extra)() = gAfterCall.load()) extra();
 }
-
 uint64_t CallTime(int i) { return gCallTimes[i].load(); }
+bool WaitCalls(int n, uint64_t timeoutNs = 2000 * kMs) {
+    return WaitUntil([n] { return gCalls.load() >= n; }, timeoutNs);
+}
 
 class RtTimer : public ::testing::Test {
 protected:
     void SetUp() override {
         if (!testsupport::CanUseRealtime()) GTEST_SKIP() << "no SCHED_FIFO privilege";
         gCalls.store(0);
-        gAfterCall.store(nullptr);
-        savedNr_ = gWakeSyscallNr.load();
-        gPalWakeStandInEnabled.store(true);
     }
     void TearDown() override {
         gAfterCall.store(nullptr);
         gPalWakeStandInEnabled.store(true);
         gWakeSyscallNr.store(savedNr_);
     }
-
     static std::unique_ptr<Timer> Start(QueltaExpiryCallbackFn fn = &RecordCall) {
         std::unique_ptr<Timer> timer(new Timer());
-        EXPECT_NE(timer, nullptr);
-        if (!timer) return timer;
         EXPECT_EQ(timer->Initialize(fn), 0);
         EXPECT_TRUE(timer->IsServing());
         return timer;
     }
-
-    // Waits until `n` callbacks have run.
-    static bool WaitCalls(int n, uint64_t timeoutNs = 2000 * kMs) {
-        return WaitUntil([n] { return gCalls.load() >= n; }, timeoutNs);
-    }
-
-    int32_t savedNr_ = 0;
+    int32_t savedNr_ = gWakeSyscallNr.load();
 };
 
 // --- deadlines ------------------------------------------------------------
@@ -113,10 +93,9 @@ TEST_F(RtTimer, CallbacksNeverRunBeforeTheirDeadline) {
             const uint64_t deadline = MonoNowNs() + ahead;
             timer->SetExpiry(Ct(deadline));
             ASSERT_TRUE(WaitCalls(++n)) << "deadline " << ahead << " ns ahead never served";
-            const uint64_t at = CallTime(n - 1);
-            ASSERT_GE(at, deadline) << "served early, " << ahead << " ns ahead";
-            EXPECT_LT(at - deadline, kLate);
-            worst = std::max(worst, at - deadline);
+            ASSERT_GE(CallTime(n - 1), deadline) << "served early, " << ahead << " ns ahead";
+            EXPECT_LT(CallTime(n - 1) - deadline, kLate);
+            worst = std::max(worst, CallTime(n - 1) - deadline);
         }
     }
     printf("worst lateness over %d deadlines: %.1f us\n", n, worst / 1e3);
@@ -124,80 +103,59 @@ TEST_F(RtTimer, CallbacksNeverRunBeforeTheirDeadline) {
 
 // The callback re-arms from the timer thread itself (no wake is attempted);
 // each new deadline is taken as soon as the callback returns.
+constexpr int kLinks = 50;
 std::atomic<Timer*> gChainTimer{nullptr};
-std::atomic<int> gChainLinks{0};
-std::atomic<uint64_t> gChainDeadlines[64];
-
+std::atomic<uint64_t> gChainDeadlines[kLinks];
 void ReArm() {
-    const int i = gCalls.load() - 1;  // the call just recorded
-    if (i + 1 >= gChainLinks.load()) return;
-    const uint64_t next = gChainDeadlines[i].load() + 1 * kMs;
-    gChainDeadlines[i + 1].store(next);
-    gChainTimer.load()->SetExpiry(Ct(next));
+    const int next = gCalls.load();
+    if (next >= kLinks) return;
+    gChainDeadlines[next].store(gChainDeadlines[next - 1].load() + 1 * kMs);
+    gChainTimer.load()->SetExpiry(Ct(gChainDeadlines[next].load()));
 }
 
 TEST_F(RtTimer, CallbackReArmingFromInsideTheCallbackChains) {
     auto timer = Start();
     gChainTimer.store(timer.get());
-    gChainLinks.store(50);
     gAfterCall.store(&ReArm);
     gChainDeadlines[0].store(MonoNowNs() + 2 * kMs);
     timer->SetExpiry(Ct(gChainDeadlines[0].load()));
-    ASSERT_TRUE(WaitCalls(50, 3000 * kMs)) << "chain stopped after " << gCalls.load();
+    ASSERT_TRUE(WaitCalls(kLinks, 3000 * kMs)) << "chain stopped after " << gCalls.load();
     usleep(20000);
-    EXPECT_EQ(gCalls.load(), 50) << "the chain's end must leave the timer parked";
-    for (int i = 0; i < 50; ++i) {
+    EXPECT_EQ(gCalls.load(), kLinks) << "the chain's end must leave the timer parked";
+    for (int i = 0; i < kLinks; ++i) {
         ASSERT_GE(CallTime(i), gChainDeadlines[i].load()) << "link " << i << " early";
         EXPECT_LT(CallTime(i) - gChainDeadlines[i].load(), kLate) << "link " << i;
     }
 }
 
+// A far deadline cut short from another thread by a nearer one, by
+// ExpireNow, or by one already past: served at once, and only once.
 TEST_F(RtTimer, NewDeadlineFromAnotherThreadTakesEffectAtOnce) {
     auto timer = Start();
-    timer->SetExpiry(Ct(MonoNowNs() + 10000 * kMs));  // a long sleep to be cut short
-    usleep(20000);
-    uint64_t deadline = 0;
-    std::thread([&] {
-        deadline = MonoNowNs() + 5 * kMs;
-        timer->SetExpiry(Ct(deadline));
-    }).join();
-    ASSERT_TRUE(WaitCalls(1, 1000 * kMs)) << "the new deadline waited for the old one";
-    const uint64_t at = CallTime(0);
-    ASSERT_GE(at, deadline);
-    printf("new deadline served %.1f us late\n", (at - deadline) / 1e3);
-    EXPECT_LT(at - deadline, 20 * kMs);
-    usleep(50000);
-    EXPECT_EQ(gCalls.load(), 1) << "the replaced deadline must not be served too";
-}
-
-TEST_F(RtTimer, ExpireNowAndPastDeadlinesRunAtOnce) {
-    auto timer = Start();
-    timer->SetExpiry(Ct(MonoNowNs() + 10000 * kMs));
-    usleep(10000);
-    uint64_t asked = 0;
-    std::thread([&] {
-        asked = MonoNowNs();
-        timer->ExpireNow();
-    }).join();
-    ASSERT_TRUE(WaitCalls(1, 1000 * kMs));
-    EXPECT_LT(CallTime(0) - asked, kLate);
-
-    asked = MonoNowNs();
-    timer->SetExpiry(Ct(asked - 1000 * kMs));
-    ASSERT_TRUE(WaitCalls(2, 1000 * kMs));
-    EXPECT_LT(CallTime(1) - asked, kLate);
-
-    // Nobody re-arms: the thread parks and the callback is not called again.
-    usleep(200000);
-    EXPECT_EQ(gCalls.load(), 2);
+    for (int n = 1; n <= 3; ++n) {
+        SCOPED_TRACE(n);
+        timer->SetExpiry(Ct(MonoNowNs() + kFar));
+        usleep(20000);
+        uint64_t due = 0;  // when the callback is due
+        std::thread([&] {
+            due = MonoNowNs();
+            if (n == 1) timer->SetExpiry(Ct(due += 5 * kMs));
+            if (n == 2) timer->ExpireNow();
+            if (n == 3) timer->SetExpiry(Ct(due - 1000 * kMs));
+        }).join();
+        ASSERT_TRUE(WaitCalls(n, 1000 * kMs)) << "the new deadline waited for the old one";
+        ASSERT_GE(CallTime(n - 1), due);
+        EXPECT_LT(CallTime(n - 1) - due, kLate);
+        printf("served %.1f us after it was due\n", (CallTime(n - 1) - due) / 1e3);
+        usleep(50000);
+        EXPECT_EQ(gCalls.load(), n) << "the replaced deadline must not be served too";
+    }
 }
 
 TEST_F(RtTimer, DeadlineSetBeforeTheThreadStartedIsServed) {
     std::unique_ptr<Timer> timer(new Timer());
-    ASSERT_NE(timer, nullptr);
-    const uint64_t early = MonoNowNs() + 5 * kMs;
     const uint64_t deadline = MonoNowNs() + 30 * kMs;
-    timer->SetExpiry(Ct(early));
+    timer->SetExpiry(Ct(deadline - 25 * kMs));
     timer->SetExpiry(Ct(deadline));  // the later call wins
     ASSERT_EQ(timer->Initialize(&RecordCall), 0);
     ASSERT_TRUE(WaitCalls(1, 1000 * kMs));
@@ -209,8 +167,7 @@ TEST_F(RtTimer, DeadlineSetBeforeTheThreadStartedIsServed) {
 
 // Two deadlines set while the thread is busy in the callback: it takes only
 // the one set last, once.
-std::atomic<bool> gHoldFirstCall{false};
-std::atomic<bool> gInFirstCall{false};
+std::atomic<bool> gHoldFirstCall{false}, gInFirstCall{false};
 void HoldFirstCall() {
     if (gCalls.load() != 1) return;
     gInFirstCall.store(true);
@@ -224,15 +181,14 @@ TEST_F(RtTimer, TwoSettingsBeforeATakeGiveOneCallbackAtTheLastSet) {
     gAfterCall.store(&HoldFirstCall);
     timer->ExpireNow();
     ASSERT_TRUE(WaitUntil([] { return gInFirstCall.load(); }, 1000 * kMs));
-    const uint64_t first = MonoNowNs() + 300 * kMs;
-    const uint64_t last = MonoNowNs() + 15 * kMs;
+    const uint64_t first = MonoNowNs() + 300 * kMs, last = MonoNowNs() + 15 * kMs;
     timer->SetExpiry(Ct(first));
     timer->SetExpiry(Ct(last));
     gHoldFirstCall.store(false);
     ASSERT_TRUE(WaitCalls(2, 1000 * kMs));
     EXPECT_GE(CallTime(1), last);
     EXPECT_LT(CallTime(1), first) << "the overwritten deadline was served";
-    ASSERT_TRUE(WaitUntil([&] { return MonoNowNs() > first + 50 * kMs; }, 2000 * kMs));
+    ASSERT_TRUE(WaitUntil([&] { return MonoNowNs() > first + 50 * kMs; }));
     EXPECT_EQ(gCalls.load(), 2);
 }
 
@@ -254,28 +210,23 @@ TEST_F(RtTimer, ThreadIsNamedAndRunsAtTopFifoPriority) {
 
 class RtTimerDestruction : public RtTimer, public ::testing::WithParamInterface<bool> {};
 
-TEST_P(RtTimerDestruction, ParkedTimerEndsPromptlyAndLeavesNothingBehind) {
+TEST_P(RtTimerDestruction, ParkedOrSleepingTimerEndsPromptlyAndLeavesNothingBehind) {
     gPalWakeStandInEnabled.store(GetParam());
-    struct sigaction before {};
+    struct sigaction before {}, after {};
     sigaction(SIGALRM, nullptr, &before);
     const int threadsBefore = testsupport::CountThreads();
-
-    auto parked = Start();   // never armed: parked on the far deadline
-    auto sleeping = Start(); // armed ten seconds ahead
-    sleeping->SetExpiry(Ct(MonoNowNs() + 10000 * kMs));
+    auto parked = Start();  // never armed: parked on the far deadline
+    auto sleeping = Start();
+    sleeping->SetExpiry(Ct(MonoNowNs() + kFar));
     const int32_t tids[] = {parked->state.threadId.load(), sleeping->state.threadId.load()};
     usleep(10000);
-
     for (std::unique_ptr<Timer>* timer : {&parked, &sleeping}) {
         const uint64_t t0 = MonoNowNs();
         timer->reset();
-        const uint64_t took = MonoNowNs() - t0;
-        printf("destruction took %.1f us\n", took / 1e3);
-        EXPECT_LT(took, 50 * kMs);
+        printf("destruction took %.1f us\n", (MonoNowNs() - t0) / 1e3);
+        EXPECT_LT(MonoNowNs() - t0, 50 * kMs);
     }
     EXPECT_EQ(gCalls.load(), 0);
-
-    struct sigaction after {};
     sigaction(SIGALRM, nullptr, &after);
     EXPECT_EQ(after.sa_handler, before.sa_handler) << "SIGALRM action not restored";
     // A joined thread can linger in /proc for a moment (under an emulator).
@@ -285,9 +236,7 @@ TEST_P(RtTimerDestruction, ParkedTimerEndsPromptlyAndLeavesNothingBehind) {
 }
 
 INSTANTIATE_TEST_SUITE_P(StandIn, RtTimerDestruction, ::testing::Values(true, false),
-                         [](const ::testing::TestParamInfo<bool>& info) {
-                             return info.param ? "On" : "Off";
-                         });
+                         [](const ::testing::TestParamInfo<bool>& info) { return info.param ? "On" : "Off"; });
 
 // --- the plain SIGALRM fallback -------------------------------------------
 
@@ -299,27 +248,23 @@ void CountingAlarm(int sig) {
     Timer::AlarmHandler(sig);
 }
 
-size_t Occurrences(const std::string& text, const std::string& what) {
-    size_t n = 0;
-    for (size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++n;
-    return n;
-}
-
-// Under the fallback a SIGALRM cannot end the sleep (EINTR resumes it), so a
-// new deadline is taken only once the one being slept on has been served. A
-// thread parked on the far deadline would never take one; the test therefore
-// arms with the stand-in on and switches it off only for the settings under
-// test.
+// While the stand-in serves, nothing is printed. Under the fallback a SIGALRM
+// cannot end the sleep (EINTR resumes it), so a new deadline is taken only
+// once the one being slept on has been served. A thread parked on the far
+// deadline would never take one; the test therefore arms with the stand-in
+// on and switches it off only for the settings under test.
 TEST_F(RtTimer, FallbackWarnsOncePerProcessSignalsEveryTimeAndServesAfterTheOldDeadline) {
     gWakeSyscallNr.store(-1);
     gWakeWarningShown.store(0);
-
+    testing::internal::CaptureStdout();
     auto a = Start();
     auto b = Start();
     const uint64_t old = MonoNowNs() + 300 * kMs;
     a->SetExpiry(Ct(old));
-    b->SetExpiry(Ct(MonoNowNs() + 10000 * kMs));
-    usleep(20000);
+    b->SetExpiry(Ct(MonoNowNs() + kFar));
+    EXPECT_EQ(WakeTimerThread(b->state.threadId.load()), 0);
+    usleep(20000);  // every stand-in signal delivered
+    EXPECT_EQ(gWakeWarningShown.load(), 0) << "the stand-in served without a word";
 
     struct sigaction counting {}, timers {};
     counting.sa_handler = &CountingAlarm;
@@ -327,15 +272,13 @@ TEST_F(RtTimer, FallbackWarnsOncePerProcessSignalsEveryTimeAndServesAfterTheOldD
     sigaction(SIGALRM, &counting, &timers);
     gAlarms.store(0);
     gPalWakeStandInEnabled.store(false);
-
-    testing::internal::CaptureStdout();
     const uint64_t fresh = MonoNowNs() + 20 * kMs;
     a->SetExpiry(Ct(fresh));  // cannot cut the sleep short
     for (int i = 0; i < 3; ++i) {
         usleep(10000);
-        b->SetExpiry(Ct(MonoNowNs() + 10000 * kMs));
+        b->SetExpiry(Ct(MonoNowNs() + kFar));
     }
-    const bool served = WaitCalls(2, 2000 * kMs);
+    const bool served = WaitCalls(2);
     std::fflush(stdout);
     const std::string out = testing::internal::GetCapturedStdout();
     sigaction(SIGALRM, &timers, nullptr);
@@ -347,11 +290,9 @@ TEST_F(RtTimer, FallbackWarnsOncePerProcessSignalsEveryTimeAndServesAfterTheOldD
     EXPECT_LT(CallTime(1) - old, kLate);
     printf("fallback: new deadline served %.1f ms late (old deadline %.1f ms after it)\n",
            (CallTime(1) - fresh) / 1e6, (old - fresh) / 1e6);
-
-    EXPECT_EQ(Occurrences(out, "Warning: using sched_wake_up system call -1 failed!\n"
-                               "This could lead to degraded nanosecond engine performance.\n"),
-              1u)
-        << out;
+    EXPECT_EQ(out,
+              "Warning: using sched_wake_up system call -1 failed!\n"
+              "This could lead to degraded nanosecond engine performance.\n");
     EXPECT_EQ(gAlarms.load(), 4) << "one SIGALRM per fallback wake";
     const int32_t ta = a->state.threadId.load(), tb = b->state.threadId.load();
     for (int i = 0; i < std::min(gAlarms.load(), 4); ++i) {
@@ -360,49 +301,25 @@ TEST_F(RtTimer, FallbackWarnsOncePerProcessSignalsEveryTimeAndServesAfterTheOldD
     }
 }
 
-TEST_F(RtTimer, StandInServesSilently) {
-    gWakeSyscallNr.store(-1);
-    gWakeWarningShown.store(0);
-    auto timer = Start();
-    testing::internal::CaptureStdout();
-    int32_t wake = -1;
-    std::thread([&] {
-        for (int i = 0; i < 5; ++i) {
-            timer->SetExpiry(Ct(MonoNowNs() + 10000 * kMs));
-            usleep(2000);
-        }
-        wake = WakeTimerThread(timer->state.threadId.load());
-    }).join();
-    std::fflush(stdout);
-    EXPECT_EQ(testing::internal::GetCapturedStdout(), "");
-    EXPECT_EQ(wake, 0);
-    EXPECT_EQ(gWakeWarningShown.load(), 0);
-}
-
 // --- concurrent setters -----------------------------------------------------
 //
 // Two threads set deadlines (some already past) at random moments while the
-// timer serves. Their settings are serialised by a test mutex so that each
-// has a sequence number k and deadline armed[k]. A callback is served for the
-// value that the thread took last; that value was set after the settings
-// completed before the previous callback ended (seq >= floor) and before the
-// callback began (seq <= seen). So each callback must come no earlier than
-// the smallest deadline in armed[floor..seen].
+// timer serves. A test mutex serialises the settings, giving each a sequence
+// number k and deadline armed[k]. A callback serves the value the thread took
+// last, which was set after the settings completed before the previous
+// callback ended (k >= floor) and before this callback began (k <= seen): so
+// no callback may come before the smallest deadline in armed[floor..seen].
 
 constexpr int kMaxSets = 1 << 16;
 std::atomic<uint64_t> gArmed[kMaxSets];
-std::atomic<int> gSetStarted{0};
-std::atomic<int> gSetDone{0};
-std::atomic<int> gStressCalls{0};
+std::atomic<int> gSetStarted{0}, gSetDone{0}, gStressCalls{0};
 std::atomic<uint64_t> gStressAt[kMaxCalls];
-std::atomic<int> gStressSeen[kMaxCalls];
-std::atomic<int> gStressFloor[kMaxCalls];
+std::atomic<int> gStressSeen[kMaxCalls], gStressFloor[kMaxCalls];
 int gFloorForNext = 0;  // timer thread only
 
 void StressCall() {
     const uint64_t now = MonoNowNs();
-    const int seen = gSetStarted.load();
-    const int i = gStressCalls.load();
+    const int seen = gSetStarted.load(), i = gStressCalls.load();
     if (i < kMaxCalls) {
         gStressAt[i].store(now);
         gStressSeen[i].store(seen);
@@ -429,17 +346,13 @@ TEST_F(RtTimer, ConcurrentSettersNeverGetEarlyCallbacksNorLoseTheLastWake) {
         gSetDone.store(k);
         return true;
     };
-
     std::atomic<bool> stop{false};
     auto writer = [&](uint32_t seed) {
         while (!stop.load()) {
             seed = seed * 1103515245u + 12345u;
-            const uint32_t r = seed >> 8;
-            const uint64_t deadline = (r % 16 == 0) ? 0  // ExpireNow-like
-                                                    : MonoNowNs() + (r % 1700) * kUs - 200 * kUs;
-            if (!set(deadline)) break;
-            const uint32_t pause = (seed >> 4) % 400;
-            if (pause > 20) usleep(pause);
+            const uint32_t r = seed >> 8;  // one in 16 like ExpireNow, else -0.2 to 1.5 ms ahead
+            if (!set(r % 16 == 0 ? 0 : MonoNowNs() + (r % 1700) * kUs - 200 * kUs)) break;
+            if ((seed >> 4) % 400 > 20) usleep((seed >> 4) % 400);
         }
     };
     std::thread w1(writer, 1u), w2(writer, 2u);
@@ -448,8 +361,10 @@ TEST_F(RtTimer, ConcurrentSettersNeverGetEarlyCallbacksNorLoseTheLastWake) {
     w1.join();
     w2.join();
 
-    // The last wake: a far deadline replaced by a near one must be served.
-    set(MonoNowNs() + 10000 * kMs);
+    // The last wake: a far deadline replaced from another thread by a near
+    // one must be served. A callback may still serve a value taken before the
+    // far setting; the one for `last` must follow at once.
+    set(MonoNowNs() + kFar);
     uint64_t last = 0;
     int lastSeq = 0;
     std::thread([&] {
@@ -457,8 +372,6 @@ TEST_F(RtTimer, ConcurrentSettersNeverGetEarlyCallbacksNorLoseTheLastWake) {
         set(last);
         lastSeq = gSetDone.load();
     }).join();
-    // A callback may still serve a value taken before the far setting; the
-    // one for `last` must follow at once.
     ASSERT_TRUE(WaitUntil(
         [&] {
             const int n = gStressCalls.load();
@@ -470,12 +383,10 @@ TEST_F(RtTimer, ConcurrentSettersNeverGetEarlyCallbacksNorLoseTheLastWake) {
     timer.reset();
 
     ASSERT_LE(calls, kMaxCalls);
-    EXPECT_GE(gStressAt[calls - 1].load(), last);
     EXPECT_LT(gStressAt[calls - 1].load() - last, kLate);
     int early = 0;
     for (int i = 0; i < calls; ++i) {
-        const int lo = std::max(gStressFloor[i].load(), 1);
-        const int hi = gStressSeen[i].load();
+        const int lo = std::max(gStressFloor[i].load(), 1), hi = gStressSeen[i].load();
         ASSERT_LE(lo, hi) << "callback " << i << " ran with no deadline set for it";
         uint64_t soonest = UINT64_MAX;
         for (int k = lo; k <= hi; ++k) soonest = std::min(soonest, gArmed[k].load());

@@ -1,12 +1,15 @@
-// Clock reads of the timing engine, through its virtual slots: which clock
-// each slot reads, the epoch offset, the 32-bit view of the kernel's fields,
-// the last-read cells, and what a failed read yields.
+// The timing engine's clock reads and units. Reads on a fake kernel clock:
+// the epoch offset, the 32-bit view of the kernel's fields, what a failed read
+// yields, the last-read cells under concurrent readers (which clock each slot
+// reads is checked by slot position in the vtable test). Units: slot 21
+// against its defining formula evaluated in full 128-bit arithmetic, slot 22
+// against exact division, slots 19 and 20 against wrapping multiplication.
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <random>
 #include <thread>
 
-#include "engine/tKPusTimingEngine.h"
 #include "engine_test_helpers.h"
 
 using namespace enginetest;
@@ -14,122 +17,93 @@ using quelta::tKPusTimingEngine;
 
 namespace {
 
-constexpr uint64_t kNs = 1000000000ull;
 constexpr int32_t kEpoch1904 = 2082844800;
 
-uint64_t KernelNowNs(clockid_t clock) {
-    timespec ts{};
-    clock_gettime(clock, &ts);
-    return static_cast<uint64_t>(ts.tv_sec) * kNs + static_cast<uint64_t>(ts.tv_nsec);
+// floor((x * 4294967 + H * 1271310319 + 2^31) / 2^32), H the high word of x,
+// with a 128-bit intermediate built from 64-bit halves (the 32-bit target has
+// no 128-bit type). False when the quotient would not fit in 64 bits.
+bool ReferenceClocksToMicroseconds(uint64_t x, uint64_t& out) {
+    struct U128 {
+        uint64_t hi, lo;
+        void Add(uint64_t b) {
+            lo += b;
+            if (lo < b) ++hi;
+        }
+    };
+    const uint32_t h = static_cast<uint32_t>(x >> 32);
+    const uint64_t high = (x >> 32) * 4294967u;  // weight 2^32
+    U128 v{high >> 32, high << 32};
+    v.Add((x & 0xFFFFFFFFu) * 4294967u);
+    v.Add(static_cast<uint64_t>(h) * 1271310319u);
+    v.Add(0x80000000u);
+#ifdef __SIZEOF_INT128__
+    // Cross-check the decomposition itself where a native type exists.
+    const unsigned __int128 n = static_cast<unsigned __int128>(x) * 4294967u +
+                                static_cast<unsigned __int128>(h) * 1271310319u + 0x80000000u;
+    EXPECT_EQ(static_cast<uint64_t>(n >> 64), v.hi);
+    EXPECT_EQ(static_cast<uint64_t>(n), v.lo);
+#endif
+    if ((v.hi >> 32) != 0) return false;
+    out = (v.hi << 32) | (v.lo >> 32);
+    return true;
 }
 
 class EngineClockTest : public ::testing::Test {
 protected:
-    ClockTime LastMonotonic() {
-        ClockTime t{1, 1};
-        e->LoadLastMonotonic(t);
-        return t;
+    void TearDown() override { delete engine; }
+    uint64_t Read(void (iKPusTimingEngine::*slot)(ClockTime&)) {
+        ClockTime t{0xDEAD, 0xBEEF};
+        (e->*slot)(t);
+        return U64(t);
     }
-    ClockTime LastGlobal() {
-        ClockTime t{1, 1};
-        e->LoadLastGlobal(t);
-        return t;
-    }
+    uint64_t Us64(uint64_t ns) { return U64(e->ClocksToMicroseconds64(CT(ns))); }
 
     EngineSeamGuard seams;
     tKPusTimingEngine* engine = new tKPusTimingEngine();
-    iKPusTimingEngine* e = engine;  // the runtime's view: virtual slots only
-
-    void TearDown() override { delete engine; }
+    iKPusTimingEngine* e = engine;
 };
 
-TEST_F(EngineClockTest, FreshEngineIsAllZero) {
-    EXPECT_EQ(U64(LastMonotonic()), 0u);
-    EXPECT_EQ(U64(LastGlobal()), 0u);
-    EXPECT_EQ(engine->statsEnabled.load(), 0u);
-    EXPECT_EQ(engine->statsCount.load(), 0);
-    EXPECT_EQ(engine->serviceMode.load(), 0u);
-    EXPECT_EQ(engine->epochOffset.load(), 0);
+TEST_F(EngineClockTest, FreshEngineReadsZeroEverywhere) {
+    EXPECT_EQ(Read(&iKPusTimingEngine::LoadLastMonotonic), 0u);
+    EXPECT_EQ(Read(&iKPusTimingEngine::LoadLastGlobal), 0u);
     uint32_t block[3004];
     e->CopyStatistics(block, 1);
     for (uint32_t w : block) ASSERT_EQ(w, 0u);
 }
 
-TEST_F(EngineClockTest, EachReadFollowsItsKernelClockAndOnlyMonotonicAndGlobalRecord) {
-    engine->SetEpochOffset(kEpoch1904);
+TEST_F(EngineClockTest, ExactArithmeticWithTheOffsetAnd32BitKernelFields) {
+    UseFakeClock();
+    const bool wideTime = sizeof(time_t) > 4;
     const struct {
-        void (iKPusTimingEngine::*slot)(ClockTime&);
-        clockid_t clock;
-        uint64_t offset;
-        int cell;  // 0 monotonic, 1 global, -1 none
-    } reads[] = {
-        {&iKPusTimingEngine::ReadMonotonic0, CLOCK_MONOTONIC, 0, 0},
-        {&iKPusTimingEngine::ReadMonotonic1, CLOCK_MONOTONIC, 0, 0},
-        {&iKPusTimingEngine::ReadGlobal2, CLOCK_REALTIME, kEpoch1904 * kNs, 1},
-        {&iKPusTimingEngine::ReadGlobal3, CLOCK_REALTIME, kEpoch1904 * kNs, 1},
-        {&iKPusTimingEngine::ReadMonotonic4, CLOCK_MONOTONIC, 0, 0},
-        {&iKPusTimingEngine::ReadMonotonic5, CLOCK_MONOTONIC, 0, 0},
-        {&iKPusTimingEngine::ReadGlobal6, CLOCK_REALTIME, kEpoch1904 * kNs, 1},
-        {&iKPusTimingEngine::ReadGlobal7, CLOCK_REALTIME, kEpoch1904 * kNs, 1},
-        {&iKPusTimingEngine::ReadRaw8, CLOCK_MONOTONIC_RAW, 0, -1},
-        {&iKPusTimingEngine::ReadRaw9, CLOCK_MONOTONIC_RAW, 0, -1},
+        timespec kernel;
+        int32_t offset;
+        uint64_t want;
+    } global[] = {
+        {Ts(1700000000, 123456789), kEpoch1904, 1700000000123456789ull + 2082844800000000000ull},
+        {Ts(1700000000, 123456789), -1000, (1700000000u - 1000u) * kNs + 123456789u},
+        {Ts(5, 250), -10, uint64_t(0) - 5 * kNs + 250},  // before the clock's zero: wraps
     };
-    for (size_t i = 0; i < sizeof reads / sizeof reads[0]; ++i) {
-        SCOPED_TRACE(i);
-        const uint64_t cells[2] = {U64(LastMonotonic()), U64(LastGlobal())};
-        const uint64_t before = KernelNowNs(reads[i].clock) + reads[i].offset;
-        ClockTime t{};
-        const auto slot = reads[i].slot;  // a local: GCC's bounds check misreads reads[i].slot in the call
-        (e->*slot)(t);
-        EXPECT_GE(U64(t), before);
-        EXPECT_LE(U64(t), KernelNowNs(reads[i].clock) + reads[i].offset);
-        const uint64_t after[2] = {U64(LastMonotonic()), U64(LastGlobal())};
-        for (int c = 0; c < 2; ++c) EXPECT_EQ(after[c], c == reads[i].cell ? U64(t) : cells[c]) << "cell " << c;
+    for (const auto& c : global) {
+        gFake.realtime = c.kernel;
+        engine->SetEpochOffset(c.offset);
+        EXPECT_EQ(Read(&iKPusTimingEngine::ReadGlobal6), c.want) << c.offset;
     }
-}
-
-TEST_F(EngineClockTest, ExactArithmeticOnAFakeClock) {
-    UseFakeClock();
-    gFake.realtime = Ts(1700000000, 123456789);
-    gFake.monotonic = Ts(86400, 5);
+    const struct {
+        timespec kernel;
+        uint64_t want;
+    } monotonic[] = {
+        {Ts(86400, 5), 86400 * kNs + 5},
+        // Seconds with bit 31 set are negative, on a 64-bit time_t as on the target...
+        {Ts(wideTime ? 0x80000000ll : INT32_MIN, 0), uint64_t(0) - 2147483648ull * kNs},
+        // ...and bits above 32 of a 64-bit tv_sec are dropped.
+        {Ts(wideTime ? 0x100000005ll : 5, 7), 5 * kNs + 7},
+    };
+    for (const auto& c : monotonic) {
+        gFake.monotonic = c.kernel;
+        EXPECT_EQ(Read(&iKPusTimingEngine::ReadMonotonic0), c.want);
+    }
     gFake.raw = Ts(86399, 999999999);
-
-    engine->SetEpochOffset(kEpoch1904);
-    ClockTime t;
-    e->ReadGlobal2(t);
-    EXPECT_EQ(U64(t), (uint64_t(kEpoch1904) + 1700000000u) * kNs + 123456789u);
-    EXPECT_EQ(U64(t) - 1700000000123456789ull, 2082844800000000000ull) << "exactly the offset in ns";
-    e->ReadMonotonic0(t);
-    EXPECT_EQ(U64(t), 86400 * kNs + 5);
-    e->ReadRaw8(t);
-    EXPECT_EQ(U64(t), 86400 * kNs - 1);
-
-    // A negative offset is added with its sign, and a result before the
-    // clock's zero wraps like 64-bit two's complement.
-    engine->SetEpochOffset(-1000);
-    e->ReadGlobal6(t);
-    EXPECT_EQ(U64(t), (1700000000u - 1000u) * kNs + 123456789u);
-    gFake.realtime = Ts(5, 250);
-    engine->SetEpochOffset(-10);
-    e->ReadGlobal7(t);
-    EXPECT_EQ(U64(t), uint64_t(0) - 5 * kNs + 250);
-    EXPECT_EQ(t.high, 0xFFFFFFFEu);
-}
-
-TEST_F(EngineClockTest, KernelFieldsAreReadAsSigned32Bit) {
-    UseFakeClock();
-    ClockTime t;
-    // Seconds with bit 31 set are negative, on a 64-bit time_t build as on
-    // the 32-bit target.
-    gFake.monotonic = Ts(static_cast<time_t>(sizeof(time_t) > 4 ? 0x80000000ll : INT32_MIN), 0);
-    e->ReadMonotonic0(t);
-    EXPECT_EQ(U64(t), uint64_t(0) - 2147483648ull * kNs);
-    if (sizeof(time_t) > 4) {
-        // Bits above 32 of a 64-bit tv_sec are dropped.
-        gFake.monotonic = Ts(static_cast<time_t>(0x100000005ll), 7);
-        e->ReadMonotonic0(t);
-        EXPECT_EQ(U64(t), 5 * kNs + 7);
-    }
+    EXPECT_EQ(Read(&iKPusTimingEngine::ReadRaw8), 86400 * kNs - 1);
 }
 
 TEST_F(EngineClockTest, FailedReadYieldsLastRecordedValueOrZeroForRaw) {
@@ -137,60 +111,32 @@ TEST_F(EngineClockTest, FailedReadYieldsLastRecordedValueOrZeroForRaw) {
     gFake.monotonic = Ts(10, 1);
     gFake.realtime = Ts(20, 2);
     gFake.raw = Ts(30, 3);
-    ClockTime t{0xDEAD, 0xBEEF};
+    gFake.failReads = true;  // before any good read: the cells' 0
+    EXPECT_EQ(Read(&iKPusTimingEngine::ReadMonotonic4), 0u);
+    gFake.failReads = false;
+    Read(&iKPusTimingEngine::ReadMonotonic4);
+    Read(&iKPusTimingEngine::ReadGlobal6);
 
-    gFake.fail = true;  // before any good read: the cells' 0
-    e->ReadMonotonic4(t);
-    EXPECT_EQ(U64(t), 0u);
-    gFake.fail = false;
-    ClockTime good;
-    e->ReadMonotonic4(good);
-    e->ReadGlobal6(good);
-
-    gFake.fail = true;
+    gFake.failReads = true;
     gFake.monotonic = Ts(99, 0);  // would be read if the call succeeded
-    t = ClockTime{0xDEAD, 0xBEEF};
-    e->ReadMonotonic5(t);
-    EXPECT_EQ(U64(t), 10 * kNs + 1);
-    EXPECT_EQ(U64(LastMonotonic()), 10 * kNs + 1);
-    e->ReadGlobal3(t);
-    EXPECT_EQ(U64(t), 20 * kNs + 2);
-    EXPECT_EQ(U64(LastGlobal()), 20 * kNs + 2);
-    t = ClockTime{0xDEAD, 0xBEEF};
-    e->ReadRaw9(t);
-    EXPECT_EQ(U64(t), 0u);
-}
-
-TEST_F(EngineClockTest, RawClockResolutionIsJoinedAndAFailureGivesZero) {
-    timespec res{};
-    clock_getres(CLOCK_MONOTONIC_RAW, &res);
-    EXPECT_EQ(U64(e->GetRawClockResolution()), static_cast<uint64_t>(res.tv_sec) * kNs + res.tv_nsec);
-
-    quelta::gSystemClock.getRes = [](clockid_t, timespec* ts) {
-        ts->tv_sec = 2;
-        ts->tv_nsec = 3;
-        return 0;
-    };
-    EXPECT_EQ(U64(e->GetRawClockResolution()), 2 * kNs + 3);
-    quelta::gSystemClock.getRes = [](clockid_t, timespec*) { return -1; };
-    EXPECT_EQ(U64(e->GetRawClockResolution()), 0u);
+    EXPECT_EQ(Read(&iKPusTimingEngine::ReadMonotonic5), 10 * kNs + 1);
+    EXPECT_EQ(Read(&iKPusTimingEngine::LoadLastMonotonic), 10 * kNs + 1);
+    EXPECT_EQ(Read(&iKPusTimingEngine::ReadGlobal3), 20 * kNs + 2);
+    EXPECT_EQ(Read(&iKPusTimingEngine::LoadLastGlobal), 20 * kNs + 2);
+    EXPECT_EQ(Read(&iKPusTimingEngine::ReadRaw9), 0u);
 }
 
 // Two readers store values that differ in both words; a torn store or load
 // would show a mix of them in the cell.
 TEST_F(EngineClockTest, LastReadCellIsNeverTorn) {
-    UseFakeClock();
-    constexpr uint64_t kA = 0x00000000FFFFFFFFull;  // 4.294967295 s
-    constexpr uint64_t kB = 0x0000000100000000ull;  // 4.294967296 s
+    constexpr uint64_t kA = 0x00000000FFFFFFFFull, kB = 0x0000000100000000ull;
     static std::atomic<int> which{0};
     quelta::gSystemClock.getTime = [](clockid_t, timespec* ts) {
         const uint64_t v = which.fetch_add(1, std::memory_order_relaxed) % 2 ? kA : kB;
-        ts->tv_sec = static_cast<time_t>(v / kNs);
-        ts->tv_nsec = static_cast<long>(v % kNs);
+        *ts = Ts(static_cast<int64_t>(v / kNs), static_cast<long>(v % kNs));
         return 0;
     };
-    ClockTime first;
-    e->ReadMonotonic0(first);
+    Read(&iKPusTimingEngine::ReadMonotonic0);
     std::atomic<bool> stop{false};
     auto reader = [&] {
         ClockTime t;
@@ -199,15 +145,93 @@ TEST_F(EngineClockTest, LastReadCellIsNeverTorn) {
     std::thread r1(reader), r2(reader);
     int torn = 0;
     for (int i = 0; i < 200000; ++i) {
-        ClockTime t;
-        e->LoadLastMonotonicFwd(t);
-        const uint64_t v = U64(t);
+        const uint64_t v = Read(&iKPusTimingEngine::LoadLastMonotonicFwd);
         if (v != kA && v != kB) ++torn;
     }
     stop.store(true);
     r1.join();
     r2.join();
     EXPECT_EQ(torn, 0);
+}
+
+TEST_F(EngineClockTest, UnitExamples) {
+    const struct {
+        uint64_t ns, us;
+    } toUs64[] = {
+        {0, 0},       {499, 0},     {500, 0}, {501, 1}, {1000, 1}, {1500, 1}, {1501, 2}, {4294967295ull, 4294967},
+        {4294967795ull, 4294968}, {14510501ull, 14510}, {0xFFFFFFFFFFFFFFFFull, 18446744073709551ull},
+    };
+    for (const auto& c : toUs64) EXPECT_EQ(Us64(c.ns), c.us) << c.ns;
+    EXPECT_EQ(e->ClocksToMicroseconds32(999), 0u);
+    EXPECT_EQ(e->ClocksToMicroseconds32(1000), 1u);
+    EXPECT_EQ(e->ClocksToMicroseconds32(0xFFFFFFFFu), 4294967u);
+    EXPECT_EQ(e->MicrosecondsToClocks32(4294968u), 704u);  // wraps modulo 2^32
+    EXPECT_EQ(e->MicrosecondsToClocks32(4294967u), 4294967000u);
+    EXPECT_EQ(U64(e->MicrosecondsToClocks64(CT(0x0123456789ABCDEFull))), 0x71C71C71C71C6D98ull);
+    EXPECT_EQ(U64(e->MicrosecondsToClocks64(CT(4294967296ull))), 4294967296000ull);
+}
+
+// Everywhere: the formula, within (-1.5, +0.5] us of the exact quotient; below
+// 14,510,501 ns exactly x / 1000 rounded to nearest, ties down.
+TEST_F(EngineClockTest, ClocksToMicroseconds64MatchesItsFormulaEverywhere) {
+    uint32_t bad = 0;
+    auto check = [&](uint64_t x) {
+        uint64_t ref = 0;
+        ASSERT_TRUE(ReferenceClocksToMicroseconds(x, ref)) << x;
+        const uint64_t got = Us64(x);
+        const int64_t d = static_cast<int64_t>(got * 1000 - x);
+        const bool ok = got == ref && d > -1500 && d <= 500 && (x >= 14510501u || got == (x + 499) / 1000);
+        if (!ok && ++bad < 5) ADD_FAILURE() << "x=" << x << " got " << got << " want " << ref;
+    };
+    for (uint64_t x = 0; x < 14510501u; x += 7) check(x);
+    for (uint64_t x = 14509000; x < 14510501u; ++x) check(x);
+    // Around every power of two and below the top, where carries happen.
+    for (int bit = 0; bit < 64; ++bit) {
+        const uint64_t p = uint64_t(1) << bit;
+        for (uint64_t delta = 0; delta < 2002; ++delta) {
+            check(p + delta - 1001);
+            check(p - 1 - delta);
+        }
+    }
+    for (uint64_t delta = 0; delta < 100000; ++delta) check(~uint64_t(0) - delta);
+    // Random inputs: the full range, and each magnitude equally often.
+    std::mt19937_64 rng(0x5EED1234u);
+    for (int i = 0; i < 1500000; ++i) {
+        const uint64_t r = rng();
+        check(r);
+        check(r >> (r % 64));
+    }
+    EXPECT_EQ(bad, 0u);
+}
+
+TEST_F(EngineClockTest, ClocksToMicroseconds32IsExactDivision) {
+    uint32_t bad = 0;
+    auto check = [&](uint64_t x) {
+        const uint32_t v = static_cast<uint32_t>(x);
+        if (e->ClocksToMicroseconds32(v) != v / 1000u && ++bad < 5) ADD_FAILURE() << v;
+    };
+    // An odd stride visits all residues mod 1000; the ends of the range are
+    // where a reciprocal's error is largest.
+    for (uint64_t x = 0; x <= 0xFFFFFFFFu; x += 4099) check(x);
+    for (uint64_t k = 4294000; k <= 4294967; ++k) {
+        check(k * 1000 - 1);
+        check(k * 1000);
+    }
+    for (uint64_t x = 0; x < 200000; ++x) {
+        check(x);
+        check(0xFFFFFFFFu - x);
+    }
+    EXPECT_EQ(bad, 0u);
+}
+
+TEST_F(EngineClockTest, MicrosecondsToClocksWrapLikeTheIntegers) {
+    std::mt19937_64 rng(42);
+    for (int i = 0; i < 200000; ++i) {
+        const uint64_t x = rng();
+        ASSERT_EQ(U64(e->MicrosecondsToClocks64(CT(x))), x * 1000u) << x;
+        const uint32_t y = static_cast<uint32_t>(x);
+        ASSERT_EQ(e->MicrosecondsToClocks32(y), y * 1000u) << y;
+    }
 }
 
 }  // namespace

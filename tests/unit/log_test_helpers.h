@@ -27,12 +27,15 @@ inline quelta::tKPLogEngine* CreateWithCpus(int32_t cpus) {
 }
 
 inline ClockTime T(uint64_t v) { return quelta::FromU64(v); }
+inline uint32_t Cpu(uint32_t event) { return (event >> 8) & 0xFFu; }  // the CPU the log put in
 
 constexpr uint32_t kUntouched = 0xDEADBEEFu;
 
+// A read-out through slot 23 into arrays with room for `room` entries (and
+// one more word each, to show nothing is written beyond).
 struct ReadOutResult {
     uint32_t count = 0;
-    std::vector<uint32_t> low, high, events, data;  // room + 1 words, kUntouched beyond
+    std::vector<uint32_t> low, high, events, data;
     uint64_t Time(size_t i) const { return (uint64_t(high[i]) << 32) | low[i]; }
     std::vector<uint32_t> Events() const { return {events.begin(), events.begin() + count}; }
     std::vector<uint32_t> Data() const { return {data.begin(), data.begin() + count}; }
@@ -42,8 +45,6 @@ struct ReadOutResult {
         return out;
     }
 };
-
-// A read-out through slot 23 into arrays with room for `room` entries.
 inline ReadOutResult ReadOut(iKPLogEngine* log, uint32_t room) {
     ReadOutResult r;
     for (auto* v : {&r.low, &r.high, &r.events, &r.data}) v->assign(room + 1, kUntouched);
@@ -51,6 +52,7 @@ inline ReadOutResult ReadOut(iKPLogEngine* log, uint32_t room) {
     log->ReadOutMerged(r.count, r.low.data(), r.high.data(), r.events.data(), r.data.data(), 0);
     return r;
 }
+inline uint32_t Held(iKPLogEngine* log) { return ReadOut(log, 100).count; }
 
 // An engine of four fake CPUs; the test thread is on fake CPU 0.
 class LogFixture : public ::testing::Test {
@@ -68,12 +70,16 @@ protected:
         quelta::gLogCpuQuery = savedQuery;
         tFakeCpu = 0;
     }
-
     // LogAt1 from fake CPU `cpu` at caller time `t`.
     void At(int cpu, uint64_t t, uint32_t event) {
         tFakeCpu = cpu;
         log->LogAt1(T(t), event);
         tFakeCpu = 0;
+    }
+    // Empties the log and switches recording on.
+    void Restart() {
+        log->Reconfigure();
+        log->SetEnabled(1);
     }
     const quelta::LogCpuRecord& Record(uint32_t i) const { return engine->records[i]; }
 
