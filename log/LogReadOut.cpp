@@ -58,7 +58,7 @@ void tKPLogEngine::ReadOutMerged(uint32_t& count, uint32_t timeLow[], uint32_t t
     for (uint32_t i = 0; i < n; ++i) {
         LogCpuRecord& record = records[frozen + i];
         const LogRing ring = LoadRing(record);
-        const uint32_t written = record.writeIndex.load(kRelaxed);
+        const uint32_t written = record.writeIndex.load(std::memory_order_acquire);
         uint32_t remaining = record.wrapCount.load(kRelaxed) != 0 ? ring.capacity : written;
         if (remaining > ring.capacity) remaining = ring.capacity;
         uint32_t pos = written - 1;

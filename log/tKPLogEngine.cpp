@@ -151,15 +151,17 @@ void tKPLogEngine::Record(const ClockTime& time, uint32_t event, uint32_t data) 
     if (ring.capacity == 0) return;
 
     uint32_t slot = record.writeIndex.load(kRelaxed);
-    if (slot >= ring.capacity) {
-        slot = 0;
-        record.wrapCount.store(record.wrapCount.load(kRelaxed) + 1, kRelaxed);
-    }
-    record.writeIndex.store(slot + 1, kRelaxed);
+    const bool wraps = slot >= ring.capacity;
+    if (wraps) slot = 0;
+    // The entry first, then the index that makes it part of the ring: a
+    // read-out never takes a slot that was claimed but not yet written (it
+    // would still hold an entry of an earlier round, seconds old).
     LogEntry& entry = ring.entries[slot];
     entry.time.store((static_cast<uint64_t>(time.high) << 32) | time.low, kRelaxed);
     entry.event.store(event, kRelaxed);
     entry.data.store(data, kRelaxed);
+    if (wraps) record.wrapCount.store(record.wrapCount.load(kRelaxed) + 1, kRelaxed);
+    record.writeIndex.store(slot + 1, std::memory_order_release);
 }
 
 void tKPLogEngine::LogAt1(const ClockTime& time, uint32_t event) { Record(time, event, kLogNoData); }
