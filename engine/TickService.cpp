@@ -82,6 +82,35 @@ bool ServeTick(tKPusTimingEngine* engine, uint64_t& nowOut) {
     return tickDue;
 }
 
+// A callback time that is due at `nowOnItsClock` is taken (NeverTime first,
+// so the callback may set its next one) and the callback runs with the pass's
+// monotonic `now`; otherwise the time, converted to the monotonic clock by
+// `global` when it is a global-clock time, is folded into gNextDeadline.
+void ServeCallbackTime(AtomicClockTime& cell, uint64_t nowOnItsClock, const ClockTime& now,
+                       iKPusTimingEngine* global) {
+    for (;;) {
+        const uint64_t t = cell.Load();
+        if (Due(t, nowOnItsClock)) {
+            if (!TakeDueCallbackTime(cell, t)) continue;  // changed meanwhile
+            CallCallback(&now);
+            return;
+        }
+        if (global == nullptr) {
+            FoldLocked(t);
+            return;
+        }
+        // The conversion is made on every pass; when it is earlier it is
+        // made once more for the value stored.
+        const uint64_t converted = ToU64(global->GlobalToMonotonic(FromU64(t)));
+        if (IsNever(t)) return;  // NeverTime cancels: never a converted instant
+        SchedLockGuard lock;
+        if (Earlier(converted, gNextDeadline.Load())) {
+            gNextDeadline.Store(ToU64(global->GlobalToMonotonic(FromU64(t))));
+        }
+        return;
+    }
+}
+
 }  // namespace
 
 void ResetTickServiceState() {
@@ -104,38 +133,11 @@ void TickServiceRoutine() {
         const bool tickDue = ServeTick(engine, now64);
         const ClockTime now = FromU64(now64);
 
-        // Monotonic callback time.
-        for (;;) {
-            uint64_t t = gMonotonicCallbackTime.Load();
-            if (Due(t, now64)) {
-                if (!TakeDueCallbackTime(gMonotonicCallbackTime, t)) continue;
-                CallCallback(&now);
-            } else {
-                FoldLocked(t);
-            }
-            break;
-        }
-
-        // Global callback time, compared on the global clock so that a step of
-        // the wall clock moves it along.
+        // The monotonic callback time, then the global one, which is compared
+        // on the global clock so that a step of the wall clock moves it along.
+        ServeCallbackTime(gMonotonicCallbackTime, now64, now, nullptr);
         const uint64_t nowGlobal = ToU64(slots->MonotonicToGlobal(now));
-        for (;;) {
-            uint64_t t = gGlobalCallbackTime.Load();
-            if (Due(t, nowGlobal)) {
-                if (!TakeDueCallbackTime(gGlobalCallbackTime, t)) continue;
-                CallCallback(&now);
-            } else {
-                const ClockTime tt = FromU64(t);
-                uint64_t converted = ToU64(slots->GlobalToMonotonic(tt));
-                if (!IsNever(t)) {
-                    SchedLockGuard lock;
-                    if (Earlier(converted, gNextDeadline.Load())) {
-                        gNextDeadline.Store(ToU64(slots->GlobalToMonotonic(tt)));
-                    }
-                }
-            }
-            break;
-        }
+        ServeCallbackTime(gGlobalCallbackTime, nowGlobal, now, slots);
 
         // Abortable global-clock waits end when the clock's generation moved.
         uint32_t generation = gGeneration.load(kRelaxed);

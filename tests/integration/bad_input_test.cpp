@@ -5,49 +5,19 @@
 
 #include <vector>
 
-#include "LoadedLibrary.h"
+#include "LibraryFixture.h"
 #include "TestSupport.h"
 
+using testsupport::CT;
 using testsupport::LoadedLibrary;
+using testsupport::U64;
 using testsupport::MonoNowNs;
 
 namespace {
 
 constexpr uint64_t kMs = 1000000;
 
-uint64_t U64(const ClockTime& t) { return (static_cast<uint64_t>(t.high) << 32) | t.low; }
-ClockTime CT(uint64_t v) { return ClockTime{static_cast<uint32_t>(v), static_cast<uint32_t>(v >> 32)}; }
-
-class BadInput : public ::testing::Test {
-protected:
-    static void SetUpTestSuite() { lib = new LoadedLibrary(); }
-    static void TearDownTestSuite() { delete lib; }
-    void SetUp() override { ASSERT_TRUE(lib->ok()) << lib->error(); }
-    const testsupport::QueltaApi& api() { return lib->api(); }
-    iKPusTimingEngine* engine() { return lib->engine(); }
-    uint64_t Now() {
-        ClockTime t;
-        engine()->ReadMonotonic0(t);
-        return U64(t);
-    }
-    // All 128 nodes can still be taken (and are given back).
-    void ExpectPoolWhole() {
-        PalSemaphore* s = testsupport::NewRuntimeSemaphore();
-        const ClockTime far = CT(Now() + 60000 * kMs);
-        std::vector<WaitNode*> nodes;
-        for (int i = 0; i < 128; ++i) {
-            WaitNode* n = nullptr;
-            ASSERT_EQ(api().EventWaitCallback(s, &far, nullptr, nullptr, 0, &n), 0u) << i;
-            nodes.push_back(n);
-        }
-        WaitNode* extra = nullptr;
-        EXPECT_EQ(api().EventWaitCallback(s, &far, nullptr, nullptr, 0, &extra), 3u);
-        for (WaitNode* n : nodes) engine()->ReleaseWait(n);
-        testsupport::DeleteRuntimeSemaphore(s);
-    }
-    static LoadedLibrary* lib;
-};
-LoadedLibrary* BadInput::lib = nullptr;
+using BadInput = testsupport::LibraryFixture;
 
 TEST_F(BadInput, NullPointersWhereTheInterfaceAllowsNoneAreRefused) {
     const uint64_t t0 = MonoNowNs();
@@ -69,7 +39,7 @@ TEST_F(BadInput, NullPointersWhereTheInterfaceAllowsNoneAreRefused) {
 
 TEST_F(BadInput, ForeignAndTwiceReleasedNodesAreRefused) {
     PalSemaphore* s = testsupport::NewRuntimeSemaphore();
-    const ClockTime far = CT(Now() + 60000 * kMs);
+    const ClockTime far = CT(MonoNow() + 60000 * kMs);
     WaitNode* n = nullptr;
     ASSERT_EQ(api().EventWaitCallback(s, &far, nullptr, nullptr, 0, &n), 0u);
     engine()->ReleaseWait(n);

@@ -1,0 +1,7 @@
+#include "LibraryFixture.h"
+
+namespace testsupport {
+
+LoadedLibrary* LibraryFixture::lib = nullptr;
+
+}  // namespace testsupport

@@ -1,0 +1,59 @@
+// One loaded libquelta.so.6 shared by the tests of a suite, with the helpers
+// those tests keep needing.
+#ifndef QUELTA_TESTS_LIBRARYFIXTURE_H
+#define QUELTA_TESTS_LIBRARYFIXTURE_H
+
+#include <gtest/gtest.h>
+
+#include <vector>
+
+#include "LoadedLibrary.h"
+
+namespace testsupport {
+
+inline uint64_t U64(const ClockTime& t) { return (static_cast<uint64_t>(t.high) << 32) | t.low; }
+inline ClockTime CT(uint64_t v) {
+    return ClockTime{static_cast<uint32_t>(v), static_cast<uint32_t>(v >> 32)};
+}
+
+class LibraryFixture : public ::testing::Test {
+protected:
+    static void SetUpTestSuite() { lib = new LoadedLibrary(); }
+    static void TearDownTestSuite() {
+        delete lib;
+        lib = nullptr;
+    }
+    void SetUp() override { ASSERT_TRUE(lib->ok()) << lib->error(); }
+    const QueltaApi& api() { return lib->api(); }
+    iKPusTimingEngine* engine() { return lib->engine(); }
+    uint64_t MonoNow() {
+        ClockTime t;
+        engine()->ReadMonotonic0(t);
+        return U64(t);
+    }
+    uint64_t GlobalNow() {
+        ClockTime g;
+        engine()->ReadGlobal2(g);
+        return U64(g);
+    }
+    // Exactly 128 nodes can be taken (and are given back); the 129th is refused.
+    void ExpectPoolWhole() {
+        PalSemaphore* s = NewRuntimeSemaphore();
+        const ClockTime far = CT(MonoNow() + 60000ull * 1000000ull);
+        std::vector<WaitNode*> nodes;
+        for (int i = 0; i < 128; ++i) {
+            WaitNode* n = nullptr;
+            ASSERT_EQ(api().EventWaitCallback(s, &far, nullptr, nullptr, 0, &n), 0u) << i;
+            nodes.push_back(n);
+        }
+        WaitNode* extra = nullptr;
+        EXPECT_EQ(api().EventWaitCallback(s, &far, nullptr, nullptr, 0, &extra), 3u);
+        for (WaitNode* n : nodes) engine()->ReleaseWait(n);
+        DeleteRuntimeSemaphore(s);
+    }
+    static LoadedLibrary* lib;
+};
+
+}  // namespace testsupport
+
+#endif
