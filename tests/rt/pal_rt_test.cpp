@@ -21,12 +21,10 @@ namespace {
 int EffectivePriority(int32_t tid) {
     std::ifstream in("/proc/self/task/" + std::to_string(tid) + "/stat");
     std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    std::istringstream fields(text.substr(text.rfind(')') + 2));
+    std::istringstream fields(text.substr(text.rfind(')') + 2));  // from field 3
     std::string field;
-    for (int i = 3; i <= 18 && (fields >> field); ++i) {
-        if (i == 18) return std::stoi(field);
-    }
-    return 0;
+    for (int i = 3; i <= 18 && (fields >> field); ++i) continue;
+    return std::stoi(field);
 }
 
 // A SCHED_RR holder of the semaphore's mutex runs at the priority of a
@@ -40,10 +38,7 @@ TEST(PalRealtime, SemaphoreMutexLendsPriorityToItsHolder) {
     std::atomic<bool> release{false};
     std::thread holder([&] {
         ASSERT_EQ(PalSetThreadPriority(pthread_self(), 10), 0);
-        int policy = -1;
-        sched_param param{};
-        pthread_getschedparam(pthread_self(), &policy, &param);
-        EXPECT_EQ(policy, SCHED_RR);
+        EXPECT_EQ(sched_getscheduler(0), SCHED_RR);
         EXPECT_EQ(PalGetThreadPriority(pthread_self()), 10);
         pthread_mutex_lock(&sem->mutex);
         holderTid = PalGetThreadId();

@@ -1,14 +1,14 @@
-// A minimal JSON reader for the tool tests: parses a whole document into a
-// tree, or fails. Enough to read back what the tools write.
+// A strict minimal JSON reader for the tool tests: a whole document into a
+// tree, or failure (duplicate keys, control characters, bad numbers).
 #ifndef QUELTA_TESTS_TOOLS_PROBE_JSON_READER_H
 #define QUELTA_TESTS_TOOLS_PROBE_JSON_READER_H
 
 #include <cctype>
 #include <cstdlib>
+#include <cstring>
 #include <fstream>
+#include <iterator>
 #include <map>
-#include <memory>
-#include <sstream>
 #include <string>
 #include <vector>
 
@@ -21,7 +21,6 @@ struct Value {
     std::string s;
     std::vector<Value> items;
     std::map<std::string, Value> fields;
-    std::vector<std::string> order;  // keys in document order
 
     bool has(const std::string& k) const { return kind == Object && fields.count(k) != 0; }
     const Value& operator[](const std::string& k) const { return fields.at(k); }
@@ -31,123 +30,78 @@ struct Value {
 class Parser {
 public:
     explicit Parser(const std::string& text) : t_(text) {}
-
-    bool Parse(Value& out) {
-        if (!ParseValue(out)) return false;
-        Space();
-        return p_ == t_.size();
-    }
+    bool Parse(Value& out) { return ParseValue(out) && (Space(), p_ == t_.size()); }
 
 private:
-    void Space() {
-        while (p_ < t_.size() && (t_[p_] == ' ' || t_[p_] == '\n' || t_[p_] == '\r' || t_[p_] == '\t')) ++p_;
+    char At() const { return p_ < t_.size() ? t_[p_] : '\0'; }
+    bool Eat(char c) { return At() == c && (++p_, true); }
+    bool Digit() const { return isdigit(static_cast<unsigned char>(At())) != 0; }
+    bool Digits() {  // one or more
+        const std::size_t from = p_;
+        while (Digit()) ++p_;
+        return p_ > from;
     }
-    bool Literal(const char* word) {
-        const std::string w(word);
-        if (t_.compare(p_, w.size(), w) != 0) return false;
-        p_ += w.size();
-        return true;
-    }
+    void Space() { while (At() == ' ' || At() == '\n' || At() == '\r' || At() == '\t') ++p_; }
+    bool Literal(const std::string& w) { return t_.compare(p_, w.size(), w) == 0 && (p_ += w.size(), true); }
     bool ParseString(std::string& out) {
-        if (p_ >= t_.size() || t_[p_] != '"') return false;
-        ++p_;
+        if (!Eat('"')) return false;
         while (p_ < t_.size() && t_[p_] != '"') {
-            char c = t_[p_++];
+            const char c = t_[p_++];
             if (static_cast<unsigned char>(c) < 0x20) return false;
-            if (c == '\\') {
-                if (p_ >= t_.size()) return false;
-                const char e = t_[p_++];
-                switch (e) {
-                    case '"': out += '"'; break;
-                    case '\\': out += '\\'; break;
-                    case '/': out += '/'; break;
-                    case 'n': out += '\n'; break;
-                    case 'r': out += '\r'; break;
-                    case 't': out += '\t'; break;
-                    case 'b': out += '\b'; break;
-                    case 'f': out += '\f'; break;
-                    case 'u': {
-                        if (p_ + 4 > t_.size()) return false;
-                        const long code = std::strtol(t_.substr(p_, 4).c_str(), nullptr, 16);
-                        p_ += 4;
-                        if (code >= 0x80) return false;  // the tools write ASCII escapes only
-                        out += static_cast<char>(code);
-                        break;
-                    }
-                    default: return false;
-                }
+            if (c != '\\') { out += c; continue; }
+            const char e = At();
+            ++p_;
+            const char* plain = std::strchr("\"\\/bfnrt", e);
+            if (e != '\0' && plain != nullptr) {
+                out += "\"\\/\b\f\n\r\t"[plain - "\"\\/bfnrt"];
+            } else if (e == 'u' && p_ + 4 <= t_.size()) {
+                const long code = std::strtol(t_.substr(p_, 4).c_str(), nullptr, 16);
+                p_ += 4;
+                if (code >= 0x80) return false;  // the tools write ASCII escapes only
+                out += static_cast<char>(code);
             } else {
-                out += c;
+                return false;
             }
         }
-        if (p_ >= t_.size()) return false;
-        ++p_;
-        return true;
+        return Eat('"');
+    }
+    // The items of an array or object, up to `close`.
+    template <typename Item>
+    bool Items(char close, Item item) {
+        Space();
+        if (Eat(close)) return true;
+        do {
+            Space();
+            if (!item()) return false;
+            Space();
+        } while (Eat(','));
+        return Eat(close);
     }
     bool ParseValue(Value& v) {
         Space();
-        if (p_ >= t_.size()) return false;
-        const char c = t_[p_];
-        if (c == '{') {
+        if (Eat('{')) {
             v.kind = Value::Object;
-            ++p_;
-            Space();
-            if (p_ < t_.size() && t_[p_] == '}') return ++p_, true;
-            for (;;) {
-                Space();
+            return Items('}', [&] {
                 std::string key;
-                if (!ParseString(key)) return false;
-                Space();
-                if (p_ >= t_.size() || t_[p_++] != ':') return false;
                 Value item;
-                if (!ParseValue(item)) return false;
-                if (v.fields.count(key)) return false;  // duplicate key
-                v.order.push_back(key);
-                v.fields.emplace(key, std::move(item));
-                Space();
-                if (p_ < t_.size() && t_[p_] == ',') { ++p_; continue; }
-                if (p_ < t_.size() && t_[p_] == '}') return ++p_, true;
-                return false;
-            }
+                if (!ParseString(key) || (Space(), !Eat(':')) || !ParseValue(item)) return false;
+                return v.fields.emplace(key, std::move(item)).second;  // duplicates fail
+            });
         }
-        if (c == '[') {
+        if (Eat('[')) {
             v.kind = Value::Array;
-            ++p_;
-            Space();
-            if (p_ < t_.size() && t_[p_] == ']') return ++p_, true;
-            for (;;) {
-                Value item;
-                if (!ParseValue(item)) return false;
-                v.items.push_back(std::move(item));
-                Space();
-                if (p_ < t_.size() && t_[p_] == ',') { ++p_; continue; }
-                if (p_ < t_.size() && t_[p_] == ']') return ++p_, true;
-                return false;
-            }
+            return Items(']', [&] { return v.items.emplace_back(), ParseValue(v.items.back()); });
         }
-        if (c == '"') {
-            v.kind = Value::String;
-            return ParseString(v.s);
-        }
-        if (Literal("true")) { v.kind = Value::Bool; v.b = true; return true; }
-        if (Literal("false")) { v.kind = Value::Bool; v.b = false; return true; }
-        if (Literal("null")) { v.kind = Value::Null; return true; }
-        // Number, in JSON's own grammar (no leading '+', no bare '.').
+        if (At() == '"') return v.kind = Value::String, ParseString(v.s);
+        if (Literal("true")) return v.kind = Value::Bool, v.b = true;
+        if (Literal("false")) return v.kind = Value::Bool, true;
+        if (Literal("null")) return true;
+        // JSON's own number grammar: no '+', no bare '.', no leading zeros.
         const std::size_t start = p_;
-        if (t_[p_] == '-') ++p_;
-        if (p_ >= t_.size() || !isdigit(static_cast<unsigned char>(t_[p_]))) return false;
-        if (t_[p_] == '0') ++p_; else while (p_ < t_.size() && isdigit(static_cast<unsigned char>(t_[p_]))) ++p_;
-        if (p_ < t_.size() && t_[p_] == '.') {
-            ++p_;
-            if (p_ >= t_.size() || !isdigit(static_cast<unsigned char>(t_[p_]))) return false;
-            while (p_ < t_.size() && isdigit(static_cast<unsigned char>(t_[p_]))) ++p_;
-        }
-        if (p_ < t_.size() && (t_[p_] == 'e' || t_[p_] == 'E')) {
-            ++p_;
-            if (p_ < t_.size() && (t_[p_] == '+' || t_[p_] == '-')) ++p_;
-            if (p_ >= t_.size() || !isdigit(static_cast<unsigned char>(t_[p_]))) return false;
-            while (p_ < t_.size() && isdigit(static_cast<unsigned char>(t_[p_]))) ++p_;
-        }
+        Eat('-');
+        if (!Eat('0') && !Digits()) return false;
+        if (Eat('.') && !Digits()) return false;
+        if ((Eat('e') || Eat('E')) && (Eat('+') || Eat('-') || true) && !Digits()) return false;
         v.kind = Value::Number;
         v.n = std::strtod(t_.substr(start, p_ - start).c_str(), nullptr);
         return true;
@@ -160,10 +114,8 @@ private:
 inline bool Parse(const std::string& text, Value& out) { return Parser(text).Parse(out); }
 
 inline std::string ReadFile(const std::string& path) {
-    std::ifstream f(path, std::ios::binary);
-    std::stringstream ss;
-    ss << f.rdbuf();
-    return ss.str();
+    std::ifstream in(path, std::ios::binary);
+    return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
 }
 
 }  // namespace probejson

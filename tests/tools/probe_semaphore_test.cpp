@@ -5,6 +5,7 @@
 #include <time.h>
 
 #include <atomic>
+#include <chrono>
 #include <thread>
 
 #include "LoadedLibrary.h"
@@ -26,32 +27,26 @@ struct Sem {
     ~Sem() { RuntimeSemaphoreDestroy(s); }
 };
 
-TEST(ProbeSemaphore, RemembersOnePostAndTimesOut) {
+TEST(ProbeSemaphore, KeepsOnePostTimesOutAndWakesAWaiter) {
     Sem sem;
     EXPECT_EQ(RuntimeSemaphorePost(sem.s), 0);
     EXPECT_EQ(RuntimeSemaphorePost(sem.s), 0);  // nobody waiting: dropped
     EXPECT_EQ(RuntimeSemaphorePending(sem.s), 1);
     EXPECT_EQ(RuntimeSemaphoreWait(sem.s, 0), 0u);
     EXPECT_EQ(RuntimeSemaphoreWait(sem.s, 0), 1u);
-
     const int64_t start = NowNs();
     EXPECT_EQ(RuntimeSemaphoreWait(sem.s, 20), 1u);
     EXPECT_GE(NowNs() - start, 20 * 1000000LL);
     EXPECT_EQ(sem.s->waiters, 0);
     EXPECT_EQ(sem.s->count, 0);
     EXPECT_EQ(RuntimeSemaphoreDestroy(nullptr), 22);
-}
 
-TEST(ProbeSemaphore, WakesABlockedWaiter) {
-    Sem sem;
     std::atomic<uint32_t> result{99};
     std::thread waiter([&] { result = RuntimeSemaphoreWait(sem.s, -1); });
-    while (true) {  // until the waiter is inside
+    for (int32_t w = 0; w != 1; std::this_thread::yield()) {  // until the waiter is inside
         pthread_mutex_lock(&sem.s->mutex);
-        const int32_t w = sem.s->waiters;
+        w = sem.s->waiters;
         pthread_mutex_unlock(&sem.s->mutex);
-        if (w == 1) break;
-        std::this_thread::yield();
     }
     EXPECT_EQ(RuntimeSemaphorePost(sem.s), 0);
     waiter.join();
@@ -73,8 +68,7 @@ TEST(ProbeSemaphore, TheLibraryWaitsOnItAndPostsIt) {
 
     // Posted by the runtime before the timeout: signalled.
     std::thread poster([&] {
-        timespec d{0, 20 * 1000000L};
-        nanosleep(&d, nullptr);
+        std::this_thread::sleep_for(std::chrono::milliseconds(20));
         RuntimeSemaphorePost(sem.s);
     });
     EXPECT_EQ(lib.api().EventWait(sem.s, 2000000), 0u);

@@ -27,153 +27,115 @@ Summary WithP99(double p99, double p50 = 1.0) {
     s.count = 1000;
     s.min = 0.5;
     s.p50 = p50;
-    s.p90 = p99;
-    s.p99 = p99;
-    s.p999 = p99;
-    s.max = p99;
+    s.p90 = s.p99 = s.p999 = s.max = p99;
     return s;
 }
 
+// Nearest rank, whatever the order of arrival: p99.9 of 1000 values is the
+// 999th, not the maximum; with few values every percentile is a sample.
 TEST(ProbeStats, NearestRankPercentilesOnKnownData) {
-    std::vector<double> v = OneToN(100);
-    std::shuffle(v.begin(), v.end(), std::mt19937(7));  // order of arrival does not matter
-    const Summary s = Summarize(v);
-    EXPECT_EQ(s.count, 100u);
-    EXPECT_EQ(s.min, 1);
-    EXPECT_EQ(s.p50, 50);
-    EXPECT_EQ(s.p90, 90);
-    EXPECT_EQ(s.p99, 99);
-    EXPECT_EQ(s.p999, 100);
-    EXPECT_EQ(s.max, 100);
-    EXPECT_EQ(s.early, 0u);
-
-    // 1000 values: p99.9 is the 999th, not the maximum.
-    const Summary k = Summarize(OneToN(1000));
-    EXPECT_EQ(k.p999, 999);
-    EXPECT_EQ(k.p99, 990);
-
-    // Few values: every percentile is one of the samples.
-    const Summary four = Summarize({4, 1, 3, 2});
-    EXPECT_EQ(four.p50, 2);
-    EXPECT_EQ(four.p90, 4);
-    const Summary one = Summarize({7.5});
-    EXPECT_EQ(one.min, 7.5);
-    EXPECT_EQ(one.p50, 7.5);
-    EXPECT_EQ(one.max, 7.5);
+    std::vector<double> shuffled = OneToN(100);
+    std::shuffle(shuffled.begin(), shuffled.end(), std::mt19937(7));
+    const std::pair<std::vector<double>, std::vector<double>> cases[] = {  // count min p50 p90 p99 p999 max
+        {shuffled, {100, 1, 50, 90, 99, 100, 100}},
+        {OneToN(1000), {1000, 1, 500, 900, 990, 999, 1000}},
+        {{4, 1, 3, 2}, {4, 1, 2, 4, 4, 4, 4}},
+        {{7.5}, {1, 7.5, 7.5, 7.5, 7.5, 7.5, 7.5}}};
+    for (const auto& [values, want] : cases) {
+        const Summary s = Summarize(values);
+        EXPECT_EQ(std::vector<double>({double(s.count), s.min, s.p50, s.p90, s.p99, s.p999, s.max}), want);
+        EXPECT_EQ(s.early, 0u);
+    }
 }
 
 TEST(ProbeStats, EmptySeriesAndEarlyValues) {
     const Summary e = Summarize({});
     EXPECT_EQ(e.count, 0u);
-    EXPECT_TRUE(std::isnan(e.min));
-    EXPECT_TRUE(std::isnan(e.p99));
-    EXPECT_TRUE(std::isnan(e.max));
+    EXPECT_TRUE(std::isnan(e.min) && std::isnan(e.p99) && std::isnan(e.max));
     EXPECT_EQ(VerdictFor(e, WithP99(100), false), "no samples");
     EXPECT_TRUE(std::isnan(qtools::RatioP99(e, WithP99(100))));
     EXPECT_TRUE(std::isnan(qtools::PercentileOfSorted({}, 0.5)));
 
-    // Zero is on time; only values below it are early.
-    const Summary s = Summarize({3, -0.5, 0, -2});
+    // Zero is on time; only values below it are early, and they override
+    // the verdict, with by how much.
+    const Summary s = Summarize({3, -0.5, 0, -12.25});
     EXPECT_EQ(s.early, 2u);
-    EXPECT_EQ(s.min, -2);
+    EXPECT_EQ(s.min, -12.25);
     EXPECT_EQ(s.max, 3);
+    const std::string v = VerdictFor(s, WithP99(100), false);
+    EXPECT_EQ(v.rfind("FAILED: returned early 2 times", 0), 0u) << v;
+    EXPECT_NE(v.find("12.2"), std::string::npos) << v;
+    EXPECT_EQ(VerdictFor(s, s, true).rfind("MACHINE FAULT", 0), 0u);
 }
 
 TEST(ProbeStats, VerdictComparesP99WithTheBaseline) {
     const Summary base = WithP99(100, 50);
     EXPECT_EQ(VerdictFor(base, base, true), "the machine's own limit");
-    EXPECT_EQ(VerdictFor(WithP99(80, 50), base, false), "as good as the machine");
-    EXPECT_EQ(VerdictFor(WithP99(110, 50), base, false), "as good as the machine");
-    EXPECT_EQ(VerdictFor(WithP99(140, 50), base, false), "within 1.5x of the machine");
-    EXPECT_EQ(VerdictFor(WithP99(190, 50), base, false), "within 2x of the machine");
-    EXPECT_EQ(VerdictFor(WithP99(300, 50), base, false),
-              "worse than the machine: p99 3.0x the baseline's (+200.0 us)");
+    const struct {
+        double p99, p50;
+        const char* verdict;
+    } cases[] = {
+        {80, 50, "as good as the machine"},
+        {110, 50, "as good as the machine"},
+        {140, 50, "within 1.5x of the machine"},
+        {190, 50, "within 2x of the machine"},
+        {300, 50, "worse than the machine: p99 3.0x the baseline's (+200.0 us)"},
+        {100, 120, "as good as the machine; typical wake-up +70.0 us"},  // a slower typical wake-up
+        {100, 60, "as good as the machine"},
+    };
+    for (const auto& c : cases) EXPECT_EQ(VerdictFor(WithP99(c.p99, c.p50), base, false), c.verdict) << c.p99;
     EXPECT_DOUBLE_EQ(qtools::RatioP99(WithP99(300), base), 3.0);
-
     // A tiny baseline: a few microseconds more is not "3x worse".
     EXPECT_EQ(VerdictFor(WithP99(6), WithP99(2), false), "as good as the machine");
-
-    // A slower typical wake-up is named even when the tail is fine.
-    EXPECT_EQ(VerdictFor(WithP99(100, 120), base, false), "as good as the machine; typical wake-up +70.0 us");
-    EXPECT_EQ(VerdictFor(WithP99(100, 60), base, false), "as good as the machine");
-
-    EXPECT_EQ(VerdictFor(WithP99(100, 50), base, false, 3), "as good as the machine; 3 calls failed");
+    EXPECT_EQ(VerdictFor(base, base, false, 3), "as good as the machine; 3 calls failed");
 }
 
-TEST(ProbeStats, EarlyReturnOverridesTheVerdict) {
-    Summary s = Summarize({-12.25, 5, 6});
-    const std::string v = VerdictFor(s, WithP99(100), false);
-    EXPECT_EQ(v.rfind("FAILED: returned early 1 times", 0), 0u) << v;
-    EXPECT_NE(v.find("12.2"), std::string::npos) << v;  // by how much
-    EXPECT_EQ(VerdictFor(s, s, true).rfind("MACHINE FAULT", 0), 0u);
-}
-
-// Tick times as the library would produce them, following its rule: each
-// tick one period after the last, unless served more than a period late,
-// when the grid restarts at that moment. `late[k]` is the true lateness.
+// Tick times following the library's rule: each tick one period after the
+// last, unless served more than a period late, when the grid restarts then.
 struct TickRun {
     std::vector<uint64_t> times;
-    std::vector<double> lateUs;
+    std::vector<double> lateUs;  // the true lateness
     std::size_t restarts = 0;
 };
 
 TickRun Simulate(const std::vector<int64_t>& lateNs) {
-    constexpr uint64_t P = 1000000;
     TickRun run;
     uint64_t due = 5000000000ull + 123456;
-    for (std::size_t k = 0; k < lateNs.size(); ++k) {
-        const uint64_t now = due + static_cast<uint64_t>(lateNs[k]);
+    for (int64_t late : lateNs) {
+        const uint64_t now = due + static_cast<uint64_t>(late);
         run.times.push_back(now);
-        run.lateUs.push_back(lateNs[k] / 1000.0);
-        due += P;
-        if (due < now) {
-            due = now;
-            ++run.restarts;
-        }
+        run.lateUs.push_back(late / 1000.0);
+        due += 1000000;
+        if (due < now) due = now, ++run.restarts;
     }
     return run;
 }
 
-TEST(ProbeTickGrid, RecoversLatenessWhenTheBestTickIsAtTheFloor) {
-    std::vector<int64_t> late;
+// Random lateness with the best tick at the floor; a tick 3.5 periods late
+// (grid restarts); and a long stretch after a restart whose late tick's
+// callback ran 20 us after its pass, placed by the floor too.
+TEST(ProbeTickGrid, RecoversTheTrueLateness) {
+    std::vector<int64_t> random;
     std::mt19937 rng(3);
-    for (int k = 0; k < 2000; ++k) late.push_back(20000 + static_cast<int64_t>(rng() % 300000));
-    late[700] = 20000;  // the best tick, as late as the floor
-    const TickRun run = Simulate(late);
-    const auto r = qtools::TickLateness(run.times, 1000000, 20.0);
-    ASSERT_EQ(r.latenessUs.size(), late.size());
-    EXPECT_EQ(r.restarts, 0u);
-    for (std::size_t k = 0; k < late.size(); ++k) EXPECT_NEAR(r.latenessUs[k], run.lateUs[k], 1e-6) << k;
-}
-
-TEST(ProbeTickGrid, FollowsTheRestartAfterAMissedTick) {
-    // Tick 10 is 3.5 periods late: the next one is due at once, and the grid
-    // goes on from that moment.
-    std::vector<int64_t> late(40, 50000);
-    late[0] = 30000;
-    late[10] = 3500000;
-    late[11] = 4000;
-    const TickRun run = Simulate(late);
-    ASSERT_EQ(run.restarts, 1u);
-    const auto r = qtools::TickLateness(run.times, 1000000, 30.0);
-    EXPECT_EQ(r.restarts, 1u);
-    for (std::size_t k = 0; k < late.size(); ++k) EXPECT_NEAR(r.latenessUs[k], run.lateUs[k], 1e-6) << k;
-}
-
-TEST(ProbeTickGrid, PlacesALongStretchAfterARestartByTheFloorToo) {
-    // The late tick's callback ran 20 us after its pass, so the restarted
-    // grid looks 20 us later than it is; the stretch's best tick is at the
-    // floor (30 us) like the first stretch's.
-    std::vector<int64_t> late(400, 60000);
-    late[0] = 30000;
-    late[50] = 2500000;
-    late[51] = 3000;
-    late[300] = 30000;
-    TickRun run = Simulate(late);
-    run.times[50] += 20000;
-    const auto r = qtools::TickLateness(run.times, 1000000, 30.0);
-    EXPECT_EQ(r.restarts, 1u);
-    for (std::size_t k = 51; k < late.size(); ++k) EXPECT_NEAR(r.latenessUs[k], run.lateUs[k], 1e-6) << k;
+    for (int k = 0; k < 2000; ++k) random.push_back(20000 + static_cast<int64_t>(rng() % 300000));
+    random[700] = 20000;
+    std::vector<int64_t> missed(40, 50000), stretch(400, 60000);
+    missed[0] = 30000, missed[10] = 3500000, missed[11] = 4000;
+    stretch[0] = 30000, stretch[50] = 2500000, stretch[51] = 3000, stretch[300] = 30000;
+    const struct {
+        std::vector<int64_t> late;
+        double floorUs;
+        std::size_t restarts, checkFrom, nudged;
+    } cases[] = {{random, 20.0, 0, 0, 0}, {missed, 30.0, 1, 0, 0}, {stretch, 30.0, 1, 51, 50}};
+    for (const auto& c : cases) {
+        TickRun run = Simulate(c.late);
+        ASSERT_EQ(run.restarts, c.restarts);
+        if (c.nudged != 0) run.times[c.nudged] += 20000;
+        const auto r = qtools::TickLateness(run.times, 1000000, c.floorUs);
+        ASSERT_EQ(r.latenessUs.size(), c.late.size());
+        EXPECT_EQ(r.restarts, c.restarts);
+        for (std::size_t k = c.checkFrom; k < c.late.size(); ++k) ASSERT_NEAR(r.latenessUs[k], run.lateUs[k], 1e-6) << k;
+    }
 }
 
 TEST(ProbeTickGrid, NeverShowsATickEarlyAndHandlesNoTicks) {
