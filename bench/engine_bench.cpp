@@ -3,6 +3,8 @@
 // reads they are built on. Goals: a read slot within 10% of the bare read of
 // its clock; a conversion (slots 15, 17) under 100 ns.
 #include <benchmark/benchmark.h>
+
+#include "RawClock.h"
 #include <time.h>
 
 #include "engine/tKPusTimingEngine.h"
@@ -23,32 +25,11 @@ iKPusTimingEngine* Engine() {
     return gBenchEngine;
 }
 
-void BM_RawClockGettimeMonotonic(benchmark::State& state) {
-    for (auto _ : state) {
-        timespec ts;
-        clock_gettime(CLOCK_MONOTONIC, &ts);
-        benchmark::DoNotOptimize(ts);
-    }
-}
-BENCHMARK(BM_RawClockGettimeMonotonic);
+BENCHMARK_CAPTURE(RawClockGettime, monotonic, CLOCK_MONOTONIC);
 
-void BM_RawClockGettimeRealtime(benchmark::State& state) {
-    for (auto _ : state) {
-        timespec ts;
-        clock_gettime(CLOCK_REALTIME, &ts);
-        benchmark::DoNotOptimize(ts);
-    }
-}
-BENCHMARK(BM_RawClockGettimeRealtime);
+BENCHMARK_CAPTURE(RawClockGettime, realtime, CLOCK_REALTIME);
 
-void BM_RawClockGettimeMonotonicRaw(benchmark::State& state) {
-    for (auto _ : state) {
-        timespec ts;
-        clock_gettime(CLOCK_MONOTONIC_RAW, &ts);
-        benchmark::DoNotOptimize(ts);
-    }
-}
-BENCHMARK(BM_RawClockGettimeMonotonicRaw);
+BENCHMARK_CAPTURE(RawClockGettime, monotonic_raw, CLOCK_MONOTONIC_RAW);
 
 void BM_Slot0_ReadMonotonic(benchmark::State& state) {
     iKPusTimingEngine* e = Engine();

@@ -11,6 +11,8 @@
 // ring. The shared-record run forces both threads onto one ring to show what
 // contention would look like.
 #include <benchmark/benchmark.h>
+
+#include "RawClock.h"
 #include <time.h>
 
 #include <algorithm>
@@ -50,14 +52,7 @@ iKPLogEngine* Prepared(bool recording) {
     return log;
 }
 
-void BM_RawClockGettimeRealtime(benchmark::State& state) {
-    for (auto _ : state) {
-        timespec ts;
-        clock_gettime(CLOCK_REALTIME, &ts);
-        benchmark::DoNotOptimize(ts);
-    }
-}
-BENCHMARK(BM_RawClockGettimeRealtime);
+BENCHMARK_CAPTURE(RawClockGettime, realtime, CLOCK_REALTIME);
 
 void BM_LogAt1(benchmark::State& state) {
     iKPLogEngine* log = Prepared(state.range(0) != 0);

@@ -36,8 +36,10 @@ protected:
         engine()->ReadGlobal2(g);
         return U64(g);
     }
-    // Exactly 128 nodes can be taken (and are given back); the 129th is refused.
-    void ExpectPoolWhole() {
+    // Exactly 128 nodes can be taken (and are given back); the 129th is
+    // refused. `whileFull` runs while all 128 are held.
+    template <typename F>
+    void ExpectPoolWhole(F whileFull) {
         PalSemaphore* s = NewRuntimeSemaphore();
         const ClockTime far = CT(MonoNow() + 60000ull * 1000000ull);
         std::vector<WaitNode*> nodes;
@@ -48,8 +50,12 @@ protected:
         }
         WaitNode* extra = nullptr;
         EXPECT_EQ(api().EventWaitCallback(s, &far, nullptr, nullptr, 0, &extra), 3u);
-        for (WaitNode* n : nodes) engine()->ReleaseWait(n);
+        whileFull(s);
+        for (WaitNode* n : nodes) engine()->ReleaseWait(n);  // cancels
         DeleteRuntimeSemaphore(s);
+    }
+    void ExpectPoolWhole() {
+        ExpectPoolWhole([](PalSemaphore*) {});
     }
     static LoadedLibrary* lib;
 };
