@@ -34,6 +34,7 @@ void tKPLogEngine::ReadOut7(uint32_t& count, uint32_t timeLow[], uint32_t timeHi
 // `last` is part of the runtime's call but carries nothing the read-out uses.
 void tKPLogEngine::ReadOutMerged(uint32_t& count, uint32_t timeLow[], uint32_t timeHigh[],
                                  uint32_t events[], uint32_t data[], uint32_t /*last*/) {
+    LogMaintenanceGuard guard(maintenanceLock);
     const uint32_t n = cpuCount;
 
     // Empty the other bank and send the recorders there; the bank they were

@@ -88,11 +88,13 @@ tKPLogEngine::~tKPLogEngine() {
     capacityPerCpu.store(Configure(0), kRelaxed);
     PalMemFree(records);
     records = nullptr;
+    pthread_mutex_destroy(&maintenanceLock);
 }
 
 iKPLogEngine* tKPLogEngine::CreateLogEngine() { return Create(); }
 
 uint32_t tKPLogEngine::Configure(int32_t capacity) {
+    LogMaintenanceGuard guard(maintenanceLock);
     enabled.store(0, kRelaxed);
     const uint32_t cap = capacity == -1 ? kLogDefaultCapacity : static_cast<uint32_t>(capacity);
     // Recorders that passed the enabled test just before get a moment to

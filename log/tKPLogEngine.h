@@ -8,6 +8,8 @@
 #ifndef QUELTA_LOG_TKPLOGENGINE_H
 #define QUELTA_LOG_TKPLOGENGINE_H
 
+#include <pthread.h>
+
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
@@ -102,7 +104,24 @@ private:
     // never index beyond the array.
     uint32_t cpuCount;
 
+    // Serialises read-outs and reconfigurations with each other (never the
+    // recorders): two read-outs at once would share the records' cursors and
+    // empty each other's banks.
+    pthread_mutex_t maintenanceLock = PTHREAD_MUTEX_INITIALIZER;
+
     void Record(const ClockTime& time, uint32_t event, uint32_t data);
+};
+
+// Holds a log engine's maintenance lock for a scope.
+class LogMaintenanceGuard {
+public:
+    explicit LogMaintenanceGuard(pthread_mutex_t& m) : m_(m) { pthread_mutex_lock(&m_); }
+    ~LogMaintenanceGuard() { pthread_mutex_unlock(&m_); }
+    LogMaintenanceGuard(const LogMaintenanceGuard&) = delete;
+    LogMaintenanceGuard& operator=(const LogMaintenanceGuard&) = delete;
+
+private:
+    pthread_mutex_t& m_;
 };
 
 }  // namespace quelta
