@@ -74,7 +74,11 @@ inline int SemaphorePost(PalSemaphore* s) {
     return rc;
 }
 
-inline uint32_t SemaphoreWait(PalSemaphore* s, int32_t timeoutMs) {
+// Waits until a post is there or the absolute CLOCK_MONOTONIC deadline has
+// passed (null: no deadline). Spurious wake-ups wait again for the same
+// deadline; the clock is monotonic, so a step of the wall clock neither
+// shortens nor stretches the wait.
+inline uint32_t SemaphoreWaitUntil(PalSemaphore* s, const timespec* deadline) {
     pthread_mutex_lock(&s->mutex);
     if (s->count != 0) {
         --s->count;
@@ -83,31 +87,46 @@ inline uint32_t SemaphoreWait(PalSemaphore* s, int32_t timeoutMs) {
     }
     ++s->waiters;
     int rc = 0;
-    if (timeoutMs < 0) {
+    if (deadline == nullptr) {
         while (rc == 0 && s->count == 0) rc = pthread_cond_wait(&s->condition, &s->mutex);
     } else {
-        timespec deadline;
-        clock_gettime(CLOCK_MONOTONIC, &deadline);
-        deadline.tv_sec += timeoutMs / 1000;
-        deadline.tv_nsec += static_cast<long>(timeoutMs % 1000) * 1000000L;
-        if (deadline.tv_nsec >= 1000000000L) {
-            deadline.tv_sec += 1;
-            deadline.tv_nsec -= 1000000000L;
-        }
-        while (rc == 0 && s->count == 0) {
-            rc = pthread_cond_timedwait(&s->condition, &s->mutex, &deadline);
-        }
+        while (rc == 0 && s->count == 0) rc = pthread_cond_timedwait(&s->condition, &s->mutex, deadline);
     }
     --s->waiters;
     uint32_t result = 0;
     if (rc == 0) {
         --s->count;
     } else {
-        if (s->count - s->waiters > 1) --s->count;  // this waiter left: trim
+        // This waiter leaves without a post, even one that came in while it
+        // was timing out; that post stays, but count must come back within
+        // waiters + 1 now that one waiter fewer exists.
+        if (s->count - s->waiters > 1) --s->count;
         result = rc == ETIMEDOUT ? 1 : 2;
     }
     pthread_mutex_unlock(&s->mutex);
     return result;
+}
+
+inline uint32_t SemaphoreWait(PalSemaphore* s, int32_t timeoutMs) {
+    if (timeoutMs < 0) return SemaphoreWaitUntil(s, nullptr);
+    if (timeoutMs == 0) {
+        // Nothing to wait for: a timed wait on a passed deadline would still
+        // sleep until the next timer interrupt. Same result and counters.
+        pthread_mutex_lock(&s->mutex);
+        const bool taken = s->count != 0;
+        if (taken) --s->count;
+        pthread_mutex_unlock(&s->mutex);
+        return taken ? 0 : 1;
+    }
+    timespec deadline;
+    clock_gettime(CLOCK_MONOTONIC, &deadline);
+    deadline.tv_sec += timeoutMs / 1000;
+    deadline.tv_nsec += static_cast<long>(timeoutMs % 1000) * 1000000L;
+    if (deadline.tv_nsec >= 1000000000L) {
+        deadline.tv_sec += 1;
+        deadline.tv_nsec -= 1000000000L;
+    }
+    return SemaphoreWaitUntil(s, &deadline);
 }
 
 // Posts not yet taken (read under the mutex).
