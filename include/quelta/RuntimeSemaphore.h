@@ -74,6 +74,19 @@ inline int SemaphorePost(PalSemaphore* s) {
     return rc;
 }
 
+// Now on `clock` plus a timeout in milliseconds (not negative), normalised.
+inline timespec DeadlineAfterMs(clockid_t clock, int32_t timeoutMs) {
+    timespec deadline{};
+    clock_gettime(clock, &deadline);
+    deadline.tv_sec += timeoutMs / 1000;
+    deadline.tv_nsec += static_cast<long>(timeoutMs % 1000) * 1000000L;
+    if (deadline.tv_nsec >= 1000000000L) {
+        deadline.tv_sec += 1;
+        deadline.tv_nsec -= 1000000000L;
+    }
+    return deadline;
+}
+
 // Waits until a post is there or the absolute CLOCK_MONOTONIC deadline has
 // passed (null: no deadline). Spurious wake-ups wait again for the same
 // deadline; the clock is monotonic, so a step of the wall clock neither
@@ -118,14 +131,7 @@ inline uint32_t SemaphoreWait(PalSemaphore* s, int32_t timeoutMs) {
         pthread_mutex_unlock(&s->mutex);
         return taken ? 0 : 1;
     }
-    timespec deadline;
-    clock_gettime(CLOCK_MONOTONIC, &deadline);
-    deadline.tv_sec += timeoutMs / 1000;
-    deadline.tv_nsec += static_cast<long>(timeoutMs % 1000) * 1000000L;
-    if (deadline.tv_nsec >= 1000000000L) {
-        deadline.tv_sec += 1;
-        deadline.tv_nsec -= 1000000000L;
-    }
+    const timespec deadline = DeadlineAfterMs(CLOCK_MONOTONIC, timeoutMs);
     return SemaphoreWaitUntil(s, &deadline);
 }
 

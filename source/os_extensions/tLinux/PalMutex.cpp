@@ -4,6 +4,7 @@
 #include <errno.h>
 #include <time.h>
 
+#include "quelta/RuntimeSemaphore.h"
 #include "tLinux/PalMemory.h"
 #include "tLinux/PalThreads.h"
 
@@ -15,14 +16,7 @@ int32_t PalLockMutexTimed(pthread_mutex_t* mutex, int32_t timeoutMs) {
         result = pthread_mutex_lock(mutex);
     } else {
         // pthread_mutex_timedlock measures its deadline on CLOCK_REALTIME.
-        timespec deadline{};
-        clock_gettime(CLOCK_REALTIME, &deadline);
-        deadline.tv_sec += timeoutMs / 1000;
-        deadline.tv_nsec += static_cast<long>(timeoutMs % 1000) * 1000000L;
-        if (deadline.tv_nsec >= 1000000000L) {
-            deadline.tv_sec += 1;
-            deadline.tv_nsec -= 1000000000L;
-        }
+        const timespec deadline = quelta_runtime::DeadlineAfterMs(CLOCK_REALTIME, timeoutMs);
         result = pthread_mutex_timedlock(mutex, &deadline);
     }
     if (result == 0) return 0;
