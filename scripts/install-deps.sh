@@ -2,7 +2,9 @@
 # Installs what building and testing need on Debian 12, as root, when missing.
 set -euo pipefail
 want=(cmake g++ make ninja-build pkg-config googletest libgtest-dev libbenchmark-dev
-      g++-arm-linux-gnueabihf libc6-dev-armhf-cross qemu-user util-linux binutils)
+      g++-arm-linux-gnueabihf libc6-dev-armhf-cross qemu-user util-linux binutils
+      g++-i686-linux-gnu libc6-dev-i386-cross libc6-i386)
+# Never g++-multilib: on Debian 12 installing it removes the ARM cross compiler.
 missing=()
 for p in "${want[@]}"; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")

@@ -1,11 +1,12 @@
 #!/usr/bin/env bash
-# Runs the whole test suite: native, ARMv7 under qemu-arm, and the sanitizer
-# builds. Usage: scripts/test.sh [native|armv7|asan|tsan|all]... (default all)
+# Runs the whole test suite: native, i686 (32-bit x86, run natively), ARMv7
+# under qemu-arm, and the sanitizer builds.
+# Usage: scripts/test.sh [native|i686|armv7|asan|tsan|all]... (default all)
 set -euo pipefail
 root=$(cd "$(dirname "$0")/.." && pwd)
 bash "$root/scripts/install-deps.sh"
 stages=("$@"); [ ${#stages[@]} -eq 0 ] && stages=(all)
-[ "${stages[0]}" = all ] && stages=(native armv7 asan tsan)
+[ "${stages[0]}" = all ] && stages=(native i686 armv7 asan tsan)
 
 build() {  # name, extra cmake args...
   local name=$1; shift
@@ -21,6 +22,9 @@ run() {  # name, extra ctest args...
 for s in "${stages[@]}"; do
   case $s in
     native) build native -DCMAKE_BUILD_TYPE=RelWithDebInfo; run native ;;
+    i686)   build i686 -DCMAKE_TOOLCHAIN_FILE="$root/cmake/i686-linux-gnu.cmake" \
+                  -DCMAKE_BUILD_TYPE=RelWithDebInfo -DQUELTA_BUILD_BENCH=OFF -DQUELTA_BUILD_TOOLS=OFF
+            run i686 ;;
     armv7)  build armv7 -DCMAKE_TOOLCHAIN_FILE="$root/cmake/arm-linux-gnueabihf.cmake" \
                   -DCMAKE_BUILD_TYPE=RelWithDebInfo -DQUELTA_BUILD_BENCH=OFF -DQUELTA_BUILD_TOOLS=OFF
             run armv7 ;;
