@@ -4,6 +4,7 @@
 
 #include "engine/ClockTimeOps.h"
 #include "engine/LibraryFrame.h"
+#include "engine/LibraryUse.h"
 #include "engine/SchedulerState.h"
 #include "engine/TimerArming.h"
 #include "engine/WaitList.h"
@@ -59,7 +60,8 @@ extern "C" QUELTA_EXPORT void quelta_iTSC_SetCallback(QueltaCallbackFn fn, void*
 }
 
 extern "C" QUELTA_EXPORT uint32_t quelta_iTSC_SetCallbackTime(const ClockTime* when, int32_t selector) {
-    if (when == nullptr) return 0;
+    CallerInside inside;  // the engine and the timer stay while we use them
+    if (!inside || when == nullptr) return 0;
     const uint64_t t = ToU64(*when);
     if (selector >= 0) return StoreCallbackTime(gMonotonicCallbackTime, t, t);
     tKPusTimingEngine* engine = gEngine.load(std::memory_order_acquire);

@@ -1,42 +1,47 @@
 // Global-clock and event waits: the waits that go through the tick service.
 //
-// With the tick service in use they take a wait node, queue it in deadline
-// order and let the timer thread fire it; without it they fall back to plain
-// sleeps and semaphore waits with millisecond timeouts.
+// With the tick service in use they take a wait node from the pool (at most
+// 128 such waits are pending at once) and block until their deadline; without
+// it they fall back to plain sleeps and semaphore waits with millisecond
+// timeouts.
+//
+// A blocking wait whose deadline is on the monotonic clock ends on the
+// waiter's own timed wake at that deadline: the kernel's timer needs no
+// second thread, so such a wait costs one wake-up, and its node is held, not
+// queued, since firing it could add nothing. In particular
+// quelta_iTSCEvent_Wait_C never posts the caller's semaphore itself: a post
+// that the wait returns 0 for, or that is still pending when it returns 1,
+// is always somebody else's, so the wait can neither lose one nor leave one
+// behind. A global-clock wait is queued as well, because the wall clock may
+// be stepped under it and the generation may change: the tick service then
+// fires its node, which posts the node's own semaphore.
+//
+// Every blocking wait blocks through BlockOn, so that unloading the library
+// ends it (result 3, or abort flag 1) before anything it uses is destroyed.
 #include <time.h>
 
 #include <cstdint>
 
 #include "engine/ClockTimeOps.h"
 #include "engine/LibraryFrame.h"
+#include "engine/LibraryUse.h"
 #include "engine/SchedulerState.h"
 #include "engine/U64Arith.h"
 #include "engine/WaitList.h"
 #include "engine/tKPusTimingEngine.h"
+#include "quelta/RuntimeSemaphore.h"
 #include "quelta/quelta.h"
 #include "tLinux/PalSemaphoreOps.h"
 #include "tLinux/PalThreads.h"
 
 namespace quelta {
 
-std::atomic<int32_t> gActiveNodeWaiters{0};
-std::atomic<bool> gStopping{false};
-
 namespace {
 
 constexpr std::memory_order kRelaxed = std::memory_order_relaxed;
 constexpr uint32_t kNoTimeout = 0xFFFFFFFFu;
 constexpr uint32_t kAbortNotStarted = 0xFFFFFFFFu;
-
-// Marks a caller inside a wait that uses a wait node, so that the stop can
-// let it leave before the pool and its semaphores are destroyed.
-class NodeWaiterScope {
-public:
-    NodeWaiterScope() { gActiveNodeWaiters.fetch_add(1, std::memory_order_acq_rel); }
-    ~NodeWaiterScope() { gActiveNodeWaiters.fetch_sub(1, std::memory_order_acq_rel); }
-    NodeWaiterScope(const NodeWaiterScope&) = delete;
-    NodeWaiterScope& operator=(const NodeWaiterScope&) = delete;
-};
+constexpr uint32_t kCannotServe = 3;
 
 iKPusTimingEngine* Engine() { return gEngine.load(std::memory_order_acquire); }
 
@@ -53,31 +58,71 @@ bool WaitBound(uint64_t monotonic, timespec& out) {
     return true;
 }
 
-// Blocks on a node's own semaphore until its deadline. Two things end the
-// wait: the tick service firing the node (which posts the semaphore), or the
-// waiter's own timed wait reaching the deadline. The second needs no second
-// thread to wake the waiter, so a wait ends one scheduler wake-up after its
-// deadline instead of two. A global-clock deadline is converted afresh on
-// every round and checked against the global clock itself, so a step of the
-// wall clock moves it. The stop posts the semaphore too; the wait then ends.
-void WaitUntilDue(iKPusTimingEngine* engine, WaitNode* node, const ClockTime& deadline, bool global) {
-    PalSemaphore* semaphore = node->semaphore.load(kRelaxed);
-    while (node->fireCount.load(std::memory_order_acquire) == 0) {
-        if (gStopping.load(std::memory_order_acquire)) return;
-        const uint64_t monotonic = global ? ToU64(engine->GlobalToMonotonicFwd(deadline)) : ToU64(deadline);
-        timespec bound;
-        const bool bounded = WaitBound(monotonic, bound);
-        const uint32_t r = PalSemaphoreWaitUntil(semaphore, bounded ? &bound : nullptr);
-        if (r == 1) {
-            if (!global) return;  // the monotonic deadline has come
-            ClockTime now;
-            engine->ReadGlobal6(now);
-            if (!Earlier(now, deadline)) return;
-            // The wall clock was stepped back: wait on for the new instant.
-        } else if (r == 2) {
-            PalSleepMilliseconds(1);
+// Blocks on `semaphore` until the monotonic time `deadline`.
+BlockResult BlockUntil(PalSemaphore* semaphore, uint64_t deadline) {
+    timespec bound;
+    const bool bounded = WaitBound(deadline, bound);
+    return BlockOn(semaphore, bounded ? &bound : nullptr);
+}
+
+// How a node-using wait ended.
+enum class WaitEnd {
+    kDue,      // its deadline has come
+    kAborted,  // its node was fired for a new generation of the global clock
+    kStopped,  // the library is being unloaded
+};
+
+// Blocks on the node's own semaphore until a monotonic deadline. Nothing
+// posts it but the stop (the node is held, not queued): the waiter's own
+// timed wake ends the wait.
+WaitEnd WaitUntilMonotonic(WaitNode* node, uint64_t deadline) {
+    PalSemaphore* own = node->ownSemaphore.load(kRelaxed);
+    for (;;) {
+        switch (BlockUntil(own, deadline)) {
+            case BlockResult::kTimedOut: return WaitEnd::kDue;
+            case BlockResult::kStopped: return WaitEnd::kStopped;
+            case BlockResult::kFailed: PalSleepMilliseconds(1); break;
+            case BlockResult::kTaken: break;  // a stray post: the deadline stands
         }
     }
+}
+
+// Blocks on the queued node's own semaphore until the global clock reaches
+// `deadline`. The bound is the deadline's monotonic equivalent, taken afresh
+// on every round, and the end is checked on the global clock itself, so a
+// step of the wall clock in either direction moves it; the tick service's
+// firing (a step forward between rounds, a new generation) ends a round
+// early. An abortable node fired while the generation differs from the
+// caller's ends the wait as aborted.
+WaitEnd WaitUntilGlobal(iKPusTimingEngine* engine, WaitNode* node, const ClockTime& deadline,
+                        uint32_t generation) {
+    PalSemaphore* own = node->ownSemaphore.load(kRelaxed);
+    for (;;) {
+        ClockTime now;
+        engine->ReadGlobal6(now);
+        if (!Earlier(now, deadline)) return WaitEnd::kDue;
+        if (node->abortable.load(kRelaxed) != 0 && node->fireCount.load(std::memory_order_acquire) != 0 &&
+            gGeneration.load(kRelaxed) != generation) {
+            return WaitEnd::kAborted;
+        }
+        switch (BlockUntil(own, GlobalToMonotonicAt(ToU64(deadline), GlobalOffset()))) {
+            case BlockResult::kStopped: return WaitEnd::kStopped;
+            case BlockResult::kFailed: PalSleepMilliseconds(1); break;
+            case BlockResult::kTaken:
+            case BlockResult::kTimedOut: break;
+        }
+    }
+}
+
+// A node as the waits take it: nothing fired, not queued yet.
+void PrepareNode(WaitNode* node, uint32_t isGlobal, uint8_t abortable, uint32_t autoRelease,
+                 PalSemaphore* semaphore) {
+    node->fireCount.store(0, kRelaxed);
+    node->prev.store(nullptr, kRelaxed);
+    node->isGlobal.store(isGlobal, kRelaxed);
+    node->abortable.store(abortable, kRelaxed);
+    node->autoRelease.store(autoRelease, kRelaxed);
+    node->semaphore.store(semaphore, kRelaxed);
 }
 
 // Global-clock wait without the tick service: one sleep of the remaining time
@@ -103,6 +148,16 @@ void SleepUntilGlobal(iKPusTimingEngine* engine, const ClockTime* target, ClockT
     if (timeAfter != nullptr) *timeAfter = now;
 }
 
+uint32_t ResultOf(BlockResult r) {
+    switch (r) {
+        case BlockResult::kTaken: return 0;
+        case BlockResult::kTimedOut: return 1;
+        case BlockResult::kStopped: return kCannotServe;
+        case BlockResult::kFailed: break;
+    }
+    return 2;
+}
+
 }  // namespace
 
 }  // namespace quelta
@@ -113,8 +168,9 @@ extern "C" QUELTA_EXPORT void quelta_iTSC_WaitUntilGlobalClocks64_C(const ClockT
                                                                     uint32_t* abortFlag,
                                                                     ClockTime* timeAfter,
                                                                     uint32_t generation) {
-    iKPusTimingEngine* engine = Engine();
-    if (engine == nullptr) {  // the library is not up
+    CallerInside inside;
+    iKPusTimingEngine* engine = inside ? Engine() : nullptr;
+    if (engine == nullptr) {  // the library is not up, or is going
         if (abortFlag != nullptr) *abortFlag = kAbortNotStarted;
         return;
     }
@@ -133,19 +189,18 @@ extern "C" QUELTA_EXPORT void quelta_iTSC_WaitUntilGlobalClocks64_C(const ClockT
         if (abortFlag != nullptr) *abortFlag = kAbortNotStarted;
         return;
     }
-    NodeWaiterScope scope;
     WaitNode* node = nullptr;
     if (target != nullptr && (target->low != 0 || target->high != 0)) node = TakeFreeNode();
     if (node != nullptr) {
-        node->abortable.store(1, kRelaxed);
-        node->fireCount.store(0, kRelaxed);
-        node->prev.store(nullptr, kRelaxed);
-        node->semaphore.store(node->ownSemaphore.load(kRelaxed), kRelaxed);
-        node->autoRelease.store(0, kRelaxed);
-        node->isGlobal.store(1, kRelaxed);
+        // Without an abort flag the caller could not be told that a new
+        // generation cut the wait short, so such a wait is not abortable.
+        PrepareNode(node, 1, abortFlag != nullptr ? 1 : 0, 0, node->ownSemaphore.load(kRelaxed));
         const ClockTime copy = *target;
-        if (InsertWaitNode(node, &copy, nullptr, nullptr) == 0) WaitUntilDue(engine, node, copy, true);
-        if (abortFlag != nullptr && generation != gGeneration.load(kRelaxed)) *abortFlag = 1;
+        WaitEnd end = WaitEnd::kDue;
+        if (InsertWaitNode(node, &copy, nullptr, nullptr) == 0) end = WaitUntilGlobal(engine, node, copy, generation);
+        if (abortFlag != nullptr && (end == WaitEnd::kStopped || generation != gGeneration.load(kRelaxed))) {
+            *abortFlag = 1;
+        }
         ReleaseWaitNode(node);
     }
     ClockTime now;
@@ -159,73 +214,69 @@ extern "C" QUELTA_EXPORT uint32_t quelta_iTSCEvent_Wait_Callback_C(PalSemaphore*
                                                                    void* callbackArg,
                                                                    uint32_t isGlobal,
                                                                    WaitNode** nodeOut) {
-    iKPusTimingEngine* engine = Engine();
+    CallerInside inside;
+    iKPusTimingEngine* engine = inside ? Engine() : nullptr;
     if (engine == nullptr || engine->UsesTickService() == 0 ||
         gEventSystemReady.load(std::memory_order_acquire) == 0 || deadline == nullptr) {
-        return 3;
+        return kCannotServe;
     }
-    NodeWaiterScope scope;
     WaitNode* node = TakeFreeNode();
-    if (node == nullptr) return 3;
-    node->autoRelease.store(1, kRelaxed);
-    node->fireCount.store(0, kRelaxed);
-    node->prev.store(nullptr, kRelaxed);
-    node->abortable.store(0, kRelaxed);
-    node->isGlobal.store(isGlobal, kRelaxed);
-    const bool ownSemaphore = semaphore == nullptr && callback == nullptr;
-    if (ownSemaphore) {
-        node->semaphore.store(node->ownSemaphore.load(kRelaxed), kRelaxed);
-        node->autoRelease.store(0, kRelaxed);
-    } else {
-        node->semaphore.store(semaphore, kRelaxed);
-    }
-    if (nodeOut != nullptr) {
-        node->autoRelease.store(0, kRelaxed);
-        *nodeOut = node;
-    }
+    if (node == nullptr) return kCannotServe;
     const ClockTime copy = *deadline;
-    const uint32_t r = InsertWaitNode(node, &copy, callback, callbackArg);
-    if (!ownSemaphore) return r;
-    if (r == 0) WaitUntilDue(engine, node, copy, isGlobal != 0);
+    const bool ownSemaphore = semaphore == nullptr && callback == nullptr;
+    if (!ownSemaphore) {
+        // Queued for the tick service, which posts, calls back and (without
+        // nodeOut) gives the node back by itself.
+        PrepareNode(node, isGlobal, 0, nodeOut != nullptr ? 0 : 1, semaphore);
+        if (nodeOut != nullptr) *nodeOut = node;
+        return InsertWaitNode(node, &copy, callback, callbackArg);
+    }
+    // A plain wait until a time on the chosen clock; a node handed out
+    // through nodeOut has been given back again when the call returns.
+    PrepareNode(node, isGlobal, 0, 0, node->ownSemaphore.load(kRelaxed));
+    if (nodeOut != nullptr) *nodeOut = node;
+    uint32_t r;
+    WaitEnd end = WaitEnd::kDue;
+    if (isGlobal != 0) {
+        r = InsertWaitNode(node, &copy, callback, callbackArg);
+        if (r == 0) end = WaitUntilGlobal(engine, node, copy, 0);
+    } else {
+        node->deadline.store(ToU64(copy), kRelaxed);
+        r = TimerServesNow() ? 0 : 1;  // without a timer the call is refused at once, as ever
+        if (r == 0) end = WaitUntilMonotonic(node, ToU64(copy));
+    }
     ReleaseWaitNode(node);
-    return r;
+    return end == WaitEnd::kStopped ? kCannotServe : r;
 }
 
 extern "C" QUELTA_EXPORT uint32_t quelta_iTSCEvent_Wait_C(PalSemaphore* semaphore, uint32_t timeout) {
-    if (semaphore == nullptr) return 3;
-    iKPusTimingEngine* engine = Engine();
-    if (engine == nullptr) return 3;
+    if (semaphore == nullptr) return kCannotServe;
+    CallerInside inside;
+    iKPusTimingEngine* engine = inside ? Engine() : nullptr;
+    if (engine == nullptr) return kCannotServe;
     if (engine->UsesTickService() == 0) {
-        if (timeout == kNoTimeout) return PalSemaphoreWait(semaphore, -1);
-        return PalSemaphoreWait(semaphore, static_cast<int32_t>(timeout / 1000u + 1u));
+        // Without the tick service: no timeout, or the timeout cut down to
+        // whole milliseconds plus one.
+        if (timeout == kNoTimeout) return ResultOf(BlockOn(semaphore, nullptr));
+        const timespec bound = quelta_runtime::DeadlineAfterMs(CLOCK_MONOTONIC, static_cast<int32_t>(timeout / 1000u + 1u));
+        return ResultOf(BlockOn(semaphore, &bound));
     }
-    if (gEventSystemReady.load(std::memory_order_acquire) == 0) return 3;
-    if (timeout == kNoTimeout) return PalSemaphoreWait(semaphore, -1);
+    if (gEventSystemReady.load(std::memory_order_acquire) == 0) return kCannotServe;
+    if (timeout == kNoTimeout) return ResultOf(BlockOn(semaphore, nullptr));
 
-    NodeWaiterScope scope;
     ClockTime now;
     engine->ReadMonotonic4(now);
     const uint32_t clocks = engine->MicrosecondsToClocks32Fwd(timeout);
-    const ClockTime deadline = FromU64(ToU64(now) + clocks);
-    WaitNode* node = nullptr;
-    const uint32_t r = quelta_iTSCEvent_Wait_Callback_C(semaphore, &deadline, nullptr, nullptr, 0, &node);
-    if (r == 3) return 3;
-    if (r == 1) {
-        ReleaseWaitNode(node);
-        return 1;
-    }
-    // Bounded by the deadline itself, so the timeout ends with this thread's
-    // own wake-up; the node, fired at the same deadline, is then cancelled.
-    timespec bound;
-    const bool bounded = WaitBound(ToU64(deadline), bound);
-    const uint32_t waited = PalSemaphoreWaitUntil(semaphore, bounded ? &bound : nullptr);
-    if (waited == 1) {
-        // If the node fired meanwhile, its post is on the semaphore: take it
-        // back, so the semaphore's count is as it was before the call.
-        if (ReleaseWaitNodeReport(node) != 0) PalSemaphoreWait(semaphore, 0);
-        return 1;
-    }
-    const uint32_t result = node->fireCount.load(std::memory_order_acquire) != 0 ? 1 : waited;
+    const uint64_t deadline = ToU64(now) + clocks;
+    // The node stands for this pending wait in the pool; it is held, not
+    // queued: the timeout is this thread's own timed wake at the deadline,
+    // and the caller's semaphore is posted by nobody but the caller's peers.
+    WaitNode* node = TakeFreeNode();
+    if (node == nullptr) return kCannotServe;
+    PrepareNode(node, 0, 0, 0, nullptr);
+    node->deadline.store(deadline, kRelaxed);
+    uint32_t result = 1;  // no serving timer: refused at once, as ever
+    if (TimerServesNow()) result = ResultOf(BlockUntil(semaphore, deadline));
     ReleaseWaitNode(node);
     return result;
 }

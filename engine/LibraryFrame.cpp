@@ -12,6 +12,7 @@
 
 #include "engine/ClockTimeOps.h"
 #include "engine/EpochOffset.h"
+#include "engine/LibraryUse.h"
 #include "engine/SchedulerState.h"
 #include "engine/TickService.h"
 #include "engine/TimerArming.h"
@@ -42,8 +43,15 @@ void DeleteLogEngine() {
     delete log;  // through the virtual deleting destructor
 }
 
+// Every use of gTimer by a caller (arming, the serving question) is made
+// under gSchedLock, so once it is null under that lock nobody is inside the
+// timer any more but its own thread, which the deletion joins.
 void DeleteTimer() {
-    iKPusLinuxTimer* timer = gTimer.exchange(nullptr, std::memory_order_acq_rel);
+    iKPusLinuxTimer* timer;
+    {
+        SchedLockGuard lock;
+        timer = gTimer.exchange(nullptr, std::memory_order_acq_rel);
+    }
     delete timer;  // stops and joins its thread
 }
 
@@ -57,22 +65,14 @@ void ReadConvertSyscallNumber() {
     std::fclose(f);
 }
 
-// Waits, at most kStopWaiterGraceMs, for every caller inside a node-using
-// wait to leave the library's code. True when none is left.
-bool WaitForNodeWaitersToLeave() {
-    for (uint32_t ms = 0; ms < kStopWaiterGraceMs; ++ms) {
-        if (gActiveNodeWaiters.load(std::memory_order_acquire) <= 0) return true;
-        PalSleepMilliseconds(1);
-    }
-    return gActiveNodeWaiters.load(std::memory_order_acquire) <= 0;
-}
-
 }  // namespace
 
 uint32_t LibraryControl(uintptr_t, uintptr_t command, uintptr_t) {
     if (command == 1) return LibraryStart();
     if (command != 0) return 1;
-    gStopping.store(true, std::memory_order_release);
+    // From here no caller enters node-using code, and any that is inside and
+    // blocks gives up (see LibraryUse.h).
+    gStopping.store(true, std::memory_order_seq_cst);
     DeleteTimer();
     EventSystemStop();
     DeleteLogEngine();
@@ -80,7 +80,7 @@ uint32_t LibraryControl(uintptr_t, uintptr_t command, uintptr_t) {
 }
 
 uint32_t LibraryStart() {
-    gStopping.store(false, std::memory_order_release);
+    gStopping.store(false, std::memory_order_seq_cst);
     tKPLogEngine* log = tKPLogEngine::Create();
     if (log == nullptr) {
         std::puts("Log engine initialization FAILED!");
@@ -158,35 +158,41 @@ uint32_t EventSystemStart() {
 }
 
 void EventSystemStop() {
-    gEventSystemReady.store(0, std::memory_order_release);
     WaitNode* pool = gWaitNodePool.load(std::memory_order_acquire);
+    bool everyoneLeft = true;
     if (pool != nullptr) {
-        // Release anyone still blocked on a node's own semaphore, and let them
-        // leave before the semaphores and the pool go away.
-        for (uint32_t i = 0; i < kWaitNodeCount; ++i) {
-            PalSemaphore* s = pool[i].ownSemaphore.load(kRelaxed);
-            if (s != nullptr) PalSemaphorePost(s);
+        // Nobody takes a node from here on; every queued node is fired (its
+        // semaphore posted), every waiter blocked inside is woken and finds
+        // the stop; then, bounded, everyone leaves before anything goes.
+        CloseEventSystemForStop();
+        WakeBlockedWaiters();
+        everyoneLeft = WaitForCallersToLeave(kStopWaiterGraceMs);
+        {
+            SchedLockGuard lock;
+            gWaitNodePool.store(nullptr, kRelaxed);
+            gFreeList.store(nullptr, kRelaxed);
+            gWaitList.store(nullptr, kRelaxed);
         }
-        if (WaitForNodeWaitersToLeave()) {
+        if (everyoneLeft) {
             for (uint32_t i = 0; i < kWaitNodeCount; ++i) {
                 PalSemaphore* s = pool[i].ownSemaphore.exchange(nullptr, kRelaxed);
                 if (s != nullptr) PalSemaphoreDestroy(s);
             }
             PalMemFree(pool);
-        } else {
-            // Destroying a semaphore under a blocked thread, or freeing a node
-            // it still reads, would be undefined; leave both allocated.
-            PAL_DEBUG_PRINT("%d waiter(s) still inside the library at stop; "
-                            "wait nodes left allocated",
-                            static_cast<int>(gActiveNodeWaiters.load()));
         }
-        SchedLockGuard lock;
-        gWaitNodePool.store(nullptr, kRelaxed);
-        gFreeList.store(nullptr, kRelaxed);
-        gWaitList.store(nullptr, kRelaxed);
+    } else {
+        everyoneLeft = WaitForCallersToLeave(kStopWaiterGraceMs);
     }
     iKPusTimingEngine* engine = gEngine.exchange(nullptr, std::memory_order_acq_rel);
-    delete engine;
+    if (everyoneLeft) {
+        delete engine;
+    } else {
+        // Destroying a semaphore under a blocked thread, or freeing a node or
+        // the engine it still reads, would be undefined; leave them.
+        PAL_DEBUG_PRINT("%d caller(s) still inside the library at stop; "
+                        "wait nodes and engine left allocated",
+                        static_cast<int>(gCallersInside.load()));
+    }
 }
 
 }  // namespace quelta

@@ -30,8 +30,8 @@ void EventSystemStop();
 // Resets the scheduler's times to their load-time values (NeverTime, period 0).
 void SetLoadTimeSchedulerState();
 
-// The stop waits at most this long for a waiter still blocked on a node's own
-// semaphore to leave before the semaphore is destroyed.
+// The stop wakes every caller blocked inside the library, then waits at most
+// this long for all of them to leave before it destroys what they use.
 constexpr uint32_t kStopWaiterGraceMs = 100;
 
 }  // namespace quelta

@@ -147,7 +147,10 @@ void TickServiceRoutine() {
         }
 
         // Expired heads, in list order; the first one not due is folded in.
-        while (FireHeadIfDue(now64)) {
+        // Global-clock heads are placed on the monotonic clock with this
+        // pass's own pair of readings, so the lock sees no conversion.
+        const int64_t offset = GlobalOffsetOf(now64, nowGlobal);
+        while (FireHeadIfDue(now64, offset)) {
         }
 
         if (tickDue) {

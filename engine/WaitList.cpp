@@ -6,7 +6,9 @@
 
 #include "engine/ClockTimeOps.h"
 #include "engine/LibraryFrame.h"
+#include "engine/LibraryUse.h"
 #include "engine/SchedulerState.h"
+#include "engine/SystemClock.h"
 #include "engine/TimerArming.h"
 #include "engine/tKPusTimingEngine.h"
 #include "nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.h"
@@ -21,6 +23,17 @@ std::atomic<bool> gSchedLockReady{false};
 
 constexpr std::memory_order kRelaxed = std::memory_order_relaxed;
 
+// Global-clock nodes on the wait list. Changed under the lock; an inserter
+// reads it before taking the lock to know whether it needs an offset, and
+// checks again under the lock.
+std::atomic<uint32_t> gQueuedGlobalNodes{0};
+
+void CountQueued(const WaitNode* node, int32_t delta) {
+    if (node->isGlobal.load(kRelaxed) != 0) {
+        gQueuedGlobalNodes.store(gQueuedGlobalNodes.load(kRelaxed) + static_cast<uint32_t>(delta), kRelaxed);
+    }
+}
+
 // Unlinks a queued node from the wait list. Lock held. The node's own links
 // keep their values; nothing else refers to it afterwards.
 void UnlinkQueued(WaitNode* node) {
@@ -33,6 +46,7 @@ void UnlinkQueued(WaitNode* node) {
         prev->next.store(next, std::memory_order_release);
         if (next != nullptr) next->prev.store(prev, kRelaxed);
     }
+    CountQueued(node, -1);
 }
 
 // Pushes a node on the free list. Lock held.
@@ -43,13 +57,15 @@ void PushFree(WaitNode* node) {
 }
 
 // Links `node` into the wait list in deadline order, behind every node whose
-// effective deadline is not later than its own. Lock held.
-void LinkSorted(WaitNode* node) {
+// effective deadline (global ones at `offset`) is not later than its own.
+// Lock held; each step is a comparison of two numbers.
+void LinkSorted(WaitNode* node, int64_t offset) {
     WaitNode* head = gWaitList.load(kRelaxed);
+    const uint64_t own = EffectiveDeadline(node, offset);
     if (head == nullptr) {
         node->next.store(nullptr, kRelaxed);
         gWaitList.store(node, std::memory_order_release);
-    } else if (Earlier(EffectiveDeadline(node), EffectiveDeadline(head))) {
+    } else if (Earlier(own, EffectiveDeadline(head, offset))) {
         node->next.store(head, kRelaxed);
         head->prev.store(node, kRelaxed);
         gWaitList.store(node, std::memory_order_release);
@@ -63,7 +79,7 @@ void LinkSorted(WaitNode* node) {
                 current->next.store(node, std::memory_order_release);
                 break;
             }
-            if (Earlier(EffectiveDeadline(node), EffectiveDeadline(following))) {
+            if (Earlier(own, EffectiveDeadline(following, offset))) {
                 node->prev.store(current, kRelaxed);
                 node->next.store(following, kRelaxed);
                 following->prev.store(node, kRelaxed);
@@ -74,12 +90,14 @@ void LinkSorted(WaitNode* node) {
         }
     }
     gWaitListVersion.fetch_add(1, kRelaxed);
+    CountQueued(node, +1);
     node->state.store(static_cast<uint32_t>(NodeState::kQueued), kRelaxed);
 }
 
+// On the timer thread, in a callback. Lock held (the timer cannot go away).
 bool OnTimerThread() {
     tKPusLinuxNanoSleepTimer* timer = gTimer.load(std::memory_order_acquire);
-    return timer != nullptr && timer->state.threadId.load(kRelaxed) == PalGetThreadId();
+    return timer != nullptr && timer->OnTimerThread();
 }
 
 // Waits a moment for the tick service to finish firing a node.
@@ -111,13 +129,32 @@ void InitSchedLock() {
 SchedLockGuard::SchedLockGuard() { pthread_mutex_lock(&gSchedLock); }
 SchedLockGuard::~SchedLockGuard() { pthread_mutex_unlock(&gSchedLock); }
 
-uint64_t EffectiveDeadline(const WaitNode* node) {
-    uint64_t deadline = node->deadline.load(kRelaxed);
-    if (node->isGlobal.load(kRelaxed) == 0) return deadline;
+int64_t GlobalOffset() {
     tKPusTimingEngine* engine = gEngine.load(std::memory_order_acquire);
-    if (engine == nullptr) return deadline;
+    if (engine == nullptr) return 0;
+    timespec ts{};
+    gSystemClock.getTime(CLOCK_MONOTONIC, &ts);  // not recorded: this is no reading of the caller's
+    const uint64_t monotonic = static_cast<uint64_t>(ts.tv_sec) * 1000000000u + static_cast<uint64_t>(ts.tv_nsec);
     iKPusTimingEngine* e = engine;
-    return ToU64(e->GlobalToMonotonicFwd(FromU64(deadline)));
+    return GlobalOffsetOf(monotonic, ToU64(e->MonotonicToGlobal(FromU64(monotonic))));
+}
+
+uint64_t GlobalToMonotonicAt(uint64_t g, int64_t offset) {
+    if (IsNever(g)) return kNeverTime64;
+    if (static_cast<uint32_t>(g >> 32) == 0xFFFFFFFFu) return 0;  // before the global zero
+    if (offset >= 0) {
+        const uint64_t o = static_cast<uint64_t>(offset);
+        return g < o ? 0 : g - o;  // before the monotonic zero: passed
+    }
+    const uint64_t o = static_cast<uint64_t>(-(offset + 1)) + 1;
+    constexpr uint64_t kLatest = kNeverTime64 - 1;
+    return g > kLatest - o ? kLatest : g + o;
+}
+
+uint64_t EffectiveDeadline(const WaitNode* node, int64_t offset) {
+    const uint64_t deadline = node->deadline.load(kRelaxed);
+    if (node->isGlobal.load(kRelaxed) == 0) return deadline;
+    return GlobalToMonotonicAt(deadline, offset);
 }
 
 void InitWaitNodePool(WaitNode* pool, uint32_t count) {
@@ -158,17 +195,25 @@ WaitNode* TakeFreeNode() {
     WaitNode* node;
     {
         SchedLockGuard lock;
+        // Checked again under the lock: the stop closes the event system in
+        // one hold of it, so nobody takes a node from a pool about to go.
+        if (gEventSystemReady.load(kRelaxed) == 0) return nullptr;
         node = gFreeList.load(kRelaxed);
         if (node == nullptr) return nullptr;
         gFreeList.store(node->next.load(kRelaxed), kRelaxed);
         node->state.store(static_cast<uint32_t>(NodeState::kHeld), kRelaxed);
         node->releasePending.store(0, kRelaxed);
     }
-    // A waiter that ended at its own deadline may have left the node's firing
+    // A global wait that ended on its own may have left the node's firing
     // post behind on its own semaphore: every use starts with it empty.
     PalSemaphore* own = node->ownSemaphore.load(kRelaxed);
     if (own != nullptr) PalSemaphoreWait(own, 0);
     return node;
+}
+
+bool TimerServesNow() {
+    SchedLockGuard lock;
+    return TimerServing();
 }
 
 uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
@@ -177,16 +222,24 @@ uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
     node->callback.store(callback, kRelaxed);
     node->deadline.store(ToU64(*deadline), kRelaxed);
 
-    bool queued = false;
-    {
+    // The offset is measured before the lock is taken, and only when a
+    // global-clock node is placed or may be passed.
+    bool needOffset = node->isGlobal.load(kRelaxed) != 0 || gQueuedGlobalNodes.load(kRelaxed) != 0;
+    for (;;) {
+        const int64_t offset = needOffset ? GlobalOffset() : 0;
         SchedLockGuard lock;
+        if (!needOffset && gQueuedGlobalNodes.load(kRelaxed) != 0) {
+            needOffset = true;  // a global node arrived meanwhile: measure, then place
+            continue;
+        }
+        bool queued = false;
         // Without a serving timer nothing would ever fire the node: refuse it
         // whatever its deadline instead of letting its waiter hang.
         if (TimerServing()) {
-            LinkSorted(node);
+            LinkSorted(node, offset);
             queued = true;
             if (gWaitList.load(kRelaxed) == node) {
-                uint64_t effective = EffectiveDeadline(node);
+                const uint64_t effective = EffectiveDeadline(node, offset);
                 if (Earlier(effective, gNextDeadline.Load())) {
                     gNextDeadline.Store(effective);
                     if (ArmTimer(FromU64(effective)) == 0) {
@@ -198,14 +251,15 @@ uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
             }
         }
         if (!queued && node->autoRelease.load(kRelaxed) != 0) PushFree(node);
+        return queued ? 0 : 1;
     }
-    return queued ? 0 : 1;
 }
 
 void ReleaseWaitNode(WaitNode* node) { (void)ReleaseWaitNodeReport(node); }
 
 uint32_t ReleaseWaitNodeReport(WaitNode* node) {
-    if (gEventSystemReady.load(kRelaxed) == 0 || node == nullptr) return 0;
+    CallerInside inside;  // the stop frees the pool only once nobody is in here
+    if (!inside || gEventSystemReady.load(kRelaxed) == 0 || node == nullptr) return 0;
     if (!IsPoolNode(node)) {
         PAL_DEBUG_PRINT("ReleaseWaitNode: %p is not a wait node of this library; ignored",
                         static_cast<void*>(node));
@@ -213,29 +267,37 @@ uint32_t ReleaseWaitNodeReport(WaitNode* node) {
     }
     if (node->prev.load(kRelaxed) == NotQueuedMark()) return 0;  // never taken
     for (uint32_t round = 0;; ++round) {
+        bool releasedTwice = false;
         {
             SchedLockGuard lock;
-            NodeState state = static_cast<NodeState>(node->state.load(kRelaxed));
-            if (state == NodeState::kFree) {
-                PAL_DEBUG_PRINT("ReleaseWaitNode: node %p released twice; ignored",
-                                static_cast<void*>(node));
-                return 0;
+            const NodeState state = static_cast<NodeState>(node->state.load(kRelaxed));
+            switch (state) {
+                case NodeState::kFree:
+                    releasedTwice = true;
+                    break;
+                case NodeState::kQueued:  // cancels the wait
+                    UnlinkQueued(node);
+                    PushFree(node);
+                    return 0;
+                case NodeState::kHeld:
+                case NodeState::kFired:  // a fired node is off the list already
+                    PushFree(node);
+                    return state == NodeState::kFired ? 1 : 0;
+                case NodeState::kFiring:
+                    // From a callback on the timer thread the firing cannot
+                    // finish while we wait: let it free the node when it settles.
+                    if (OnTimerThread()) {
+                        node->releasePending.store(1, kRelaxed);
+                        return 1;
+                    }
+                    break;
             }
-            if (state == NodeState::kQueued) {  // cancels the wait
-                UnlinkQueued(node);
-                PushFree(node);
-                return 0;
-            }
-            if (state == NodeState::kHeld || state == NodeState::kFired) {
-                PushFree(node);  // a fired node is off the list already
-                return state == NodeState::kFired ? 1 : 0;
-            }
-            // kFiring. From a callback on the timer thread the firing cannot
-            // finish while we wait: let it free the node when it settles.
-            if (OnTimerThread()) {
-                node->releasePending.store(1, kRelaxed);
-                return 1;
-            }
+        }
+        // Written without the lock: standard error may block (a full pipe),
+        // and the timer thread must never wait for that.
+        if (releasedTwice) {
+            PAL_DEBUG_PRINT("ReleaseWaitNode: node %p released twice; ignored", static_cast<void*>(node));
+            return 0;
         }
         PauseForFiring(round);
     }
@@ -250,6 +312,16 @@ static void DetachForFiring(WaitNode* node) {
     node->state.store(static_cast<uint32_t>(NodeState::kFiring), kRelaxed);
 }
 
+// Under the lock, after the post (and callback): the node goes back to the
+// free list or stays with its holder, fired.
+static void SettleFired(WaitNode* node, uint32_t release) {
+    if (release != 0 || node->releasePending.load(kRelaxed) != 0) {
+        PushFree(node);
+    } else {
+        node->state.store(static_cast<uint32_t>(NodeState::kFired), kRelaxed);
+    }
+}
+
 // Without the lock: post, callback, then settle where the node goes.
 static void FinishFiring(WaitNode* node) {
     PalSemaphore* semaphore = node->semaphore.load(kRelaxed);
@@ -261,11 +333,7 @@ static void FinishFiring(WaitNode* node) {
         node->autoRelease.store(release, kRelaxed);
     }
     SchedLockGuard lock;
-    if (release != 0 || node->releasePending.load(kRelaxed) != 0) {
-        PushFree(node);
-    } else {
-        node->state.store(static_cast<uint32_t>(NodeState::kFired), kRelaxed);
-    }
+    SettleFired(node, release);
 }
 
 void FireWaitNode(WaitNode* node) {
@@ -277,24 +345,43 @@ void FireWaitNode(WaitNode* node) {
     FinishFiring(node);
 }
 
-bool FireHeadIfDue(uint64_t now) {
+bool FireHeadIfDue(uint64_t now, int64_t offset) {
     WaitNode* head;
     {
         SchedLockGuard lock;
         head = gWaitList.load(kRelaxed);
         if (head == nullptr) return false;
-        if (!Due(EffectiveDeadline(head), now)) {
+        const uint64_t effective = EffectiveDeadline(head, offset);
+        if (!Due(effective, now)) {
             // The head stays queued: fold its deadline into the next arming.
-            uint64_t effective = EffectiveDeadline(head);
-            if (Earlier(effective, gNextDeadline.Load())) {
-                gNextDeadline.Store(EffectiveDeadline(head));
-            }
+            if (Earlier(effective, gNextDeadline.Load())) gNextDeadline.Store(effective);
             return false;
         }
         DetachForFiring(head);
     }
     FinishFiring(head);
     return true;
+}
+
+uint32_t CloseEventSystemForStop() {
+    WaitNode* fired[kWaitNodeCount];
+    uint32_t n = 0;
+    {
+        SchedLockGuard lock;
+        gEventSystemReady.store(0, std::memory_order_release);
+        gFreeList.store(nullptr, kRelaxed);
+        while (WaitNode* node = gWaitList.load(kRelaxed)) {
+            if (n == kWaitNodeCount) break;
+            DetachForFiring(node);
+            fired[n++] = node;
+        }
+    }
+    for (uint32_t i = 0; i < n; ++i) {
+        if (PalSemaphore* semaphore = fired[i]->semaphore.load(kRelaxed)) PalSemaphorePost(semaphore);
+    }
+    SchedLockGuard lock;
+    for (uint32_t i = 0; i < n; ++i) SettleFired(fired[i], fired[i]->autoRelease.load(kRelaxed));
+    return n;
 }
 
 void FireAbortableGlobalNodes() {

@@ -6,11 +6,14 @@
 // or being fired. Links (`next`, `prev`), the list heads, node `state`, the
 // version counter and the arming of the earliest deadline change only under
 // gSchedLock, a priority-inheriting mutex. Its critical sections are short
-// list operations: a walk of at most 128 nodes (each global-clock node costs
-// one clock conversion) plus one SetExpiry. The lock is never held across a
-// semaphore post or a callback, so the timer thread never waits for a caller
-// longer than one such operation, and a caller holding it is boosted to the
-// timer thread's priority while the timer thread waits.
+// list operations: a walk of at most 128 nodes, each step a comparison of
+// two 64-bit numbers, plus one SetExpiry. Nothing slow happens under it: no
+// clock conversion (a global-clock deadline is placed with one offset between
+// the global and the monotonic clock, measured before the lock is taken, see
+// GlobalOffset), no I/O (diagnostics are written after it is released), no
+// semaphore post and no callback. So the timer thread never waits for a
+// caller longer than one such operation, and a caller holding it is boosted
+// to the timer thread's priority while the timer thread waits.
 //
 // Firing is split in two: under the lock the tick service unlinks the node
 // and marks it kFiring; without the lock it posts the semaphore and runs the
@@ -85,16 +88,38 @@ public:
     SchedLockGuard& operator=(const SchedLockGuard&) = delete;
 };
 
+// The offset between the global and the monotonic clock at one moment:
+// global time minus monotonic time (wrapping). Every step and slew of the
+// wall clock up to that moment is in it. Measured with one conversion
+// (engine slot 15) outside any lock; 0 without an engine.
+int64_t GlobalOffset();
+// The same from a pass's own reading pair (now and its global equivalent).
+inline int64_t GlobalOffsetOf(uint64_t monotonic, uint64_t global) {
+    return static_cast<int64_t>(global - monotonic);
+}
+
+// The monotonic time of global time `g` at `offset`, as the scheduler reads
+// it: NeverTime stays NeverTime; a time that comes before the global zero in
+// the library's order (high word 0xFFFFFFFF), or that lies before the
+// monotonic clock's zero, has passed and reads 0; a time beyond the
+// monotonic range reads as the latest ordinary time.
+uint64_t GlobalToMonotonicAt(uint64_t g, int64_t offset);
+
 // The node's effective deadline: its deadline, or for a global-clock node the
-// monotonic equivalent through the engine's GlobalToMonotonicFwd.
-uint64_t EffectiveDeadline(const WaitNode* node);
+// monotonic equivalent at `offset`.
+uint64_t EffectiveDeadline(const WaitNode* node, int64_t offset);
 
 // Builds a pool in `pool` (zeroed, linked, autoRelease 1, not-queued mark)
 // without semaphores; start-up adds them. Makes it the free list.
 void InitWaitNodePool(WaitNode* pool, uint32_t count);
 
 // Pops the free list; null when it is empty or the event system is not ready.
+// The node comes with its own semaphore empty.
 WaitNode* TakeFreeNode();
+
+// True when a timer serves expiries (read under gSchedLock, so that the stop
+// cannot delete the timer under the question).
+bool TimerServesNow();
 
 // 0 queued (it may already have fired); 1 no timer, not queued.
 uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
@@ -105,16 +130,20 @@ void ReleaseWaitNode(WaitNode* node);
 uint32_t ReleaseWaitNodeReport(WaitNode* node);
 void FireWaitNode(WaitNode* node);  // tick service only
 
-// Tick service helpers. Fires the head when its effective deadline is due at
-// `now` and returns true; otherwise folds the head's deadline into
-// gNextDeadline and returns false (also false for an empty list).
-bool FireHeadIfDue(uint64_t now);
+// Tick service helpers. Fires the head when its effective deadline (global
+// ones at `offset`) is due at `now` and returns true; otherwise folds the
+// head's deadline into gNextDeadline and returns false (also false for an
+// empty list).
+bool FireHeadIfDue(uint64_t now, int64_t offset);
 // Fires every queued global-clock node that is abortable, in list order.
 void FireAbortableGlobalNodes();
 
-// Callers inside node-using waits; the stop waits for them to leave.
-extern std::atomic<int32_t> gActiveNodeWaiters;
-extern std::atomic<bool> gStopping;
+// The stop, once the timer thread is gone: in one hold of the lock the event
+// system is marked not ready and the free list emptied (no caller can take a
+// node any more), and every queued node is fired as the tick service would,
+// except that no callback runs (the library is going away under it); then
+// their semaphores are posted. Returns the number of nodes fired.
+uint32_t CloseEventSystemForStop();
 
 // True when `node` points at a node of the current pool.
 bool IsPoolNode(const WaitNode* node);

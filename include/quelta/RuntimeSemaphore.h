@@ -88,10 +88,13 @@ inline timespec DeadlineAfterMs(clockid_t clock, int32_t timeoutMs) {
 }
 
 // Waits until a post is there or the absolute CLOCK_MONOTONIC deadline has
-// passed (null: no deadline). Spurious wake-ups wait again for the same
-// deadline; the clock is monotonic, so a step of the wall clock neither
-// shortens nor stretches the wait.
-inline uint32_t SemaphoreWaitUntil(PalSemaphore* s, const timespec* deadline) {
+// passed (null: no deadline), unless `abandon()` turns true first: it is asked
+// with the mutex held before the first wait and after every wake-up, and a
+// waiter that abandons takes no post and returns 3. Spurious wake-ups wait
+// again for the same deadline; the clock is monotonic, so a step of the wall
+// clock neither shortens nor stretches the wait.
+template <class Abandon>
+inline uint32_t SemaphoreWaitUntilUnless(PalSemaphore* s, const timespec* deadline, Abandon abandon) {
     pthread_mutex_lock(&s->mutex);
     if (s->count != 0) {
         --s->count;
@@ -100,24 +103,32 @@ inline uint32_t SemaphoreWaitUntil(PalSemaphore* s, const timespec* deadline) {
     }
     ++s->waiters;
     int rc = 0;
-    if (deadline == nullptr) {
-        while (rc == 0 && s->count == 0) rc = pthread_cond_wait(&s->condition, &s->mutex);
-    } else {
-        while (rc == 0 && s->count == 0) rc = pthread_cond_timedwait(&s->condition, &s->mutex, deadline);
+    bool abandoned = false;
+    while (rc == 0 && s->count == 0) {
+        if (abandon()) {
+            abandoned = true;
+            break;
+        }
+        rc = deadline == nullptr ? pthread_cond_wait(&s->condition, &s->mutex)
+                                 : pthread_cond_timedwait(&s->condition, &s->mutex, deadline);
     }
     --s->waiters;
     uint32_t result = 0;
-    if (rc == 0) {
+    if (rc == 0 && !abandoned) {
         --s->count;
     } else {
         // This waiter leaves without a post, even one that came in while it
         // was timing out; that post stays, but count must come back within
         // waiters + 1 now that one waiter fewer exists.
         if (s->count - s->waiters > 1) --s->count;
-        result = rc == ETIMEDOUT ? 1 : 2;
+        result = abandoned ? 3 : rc == ETIMEDOUT ? 1 : 2;
     }
     pthread_mutex_unlock(&s->mutex);
     return result;
+}
+
+inline uint32_t SemaphoreWaitUntil(PalSemaphore* s, const timespec* deadline) {
+    return SemaphoreWaitUntilUnless(s, deadline, [] { return false; });
 }
 
 inline uint32_t SemaphoreWait(PalSemaphore* s, int32_t timeoutMs) {

@@ -11,6 +11,7 @@
 
 #include "TestSupport.h"
 #include "engine/LibraryFrame.h"
+#include "engine/LibraryUse.h"
 #include "engine/SchedulerState.h"
 #include "engine/TimerArming.h"
 #include "engine/WaitList.h"
@@ -122,7 +123,7 @@ TEST(Startup, StopReleasesAWaiterBlockedOnItsOwnSemaphore) {
         quelta_iTSCEvent_Wait_Callback_C(nullptr, &far, nullptr, nullptr, 0, nullptr);
         done = 1;
     });
-    while (gActiveNodeWaiters.load() == 0) PalSleepMilliseconds(1);
+    while (gCallersInside.load() == 0) PalSleepMilliseconds(1);
     PalSleepMilliseconds(5);
     const uint64_t t0 = testsupport::MonoNowNs();
     LibraryControl(0, 0, 0);

@@ -30,61 +30,45 @@ using Timer = tKPusLinuxNanoSleepTimer;
 
 constexpr uint64_t kMs = 1000000ull;
 
-int32_t Tid() { return static_cast<int32_t>(syscall(SYS_gettid)); }
-
-// The stand-in relies on the timer's SIGALRM handler: installed for each test
-// and put back afterwards, with the dispatch settings.
+// The dispatch settings are put back after each test.
 class WakeFixture : public ::testing::Test {
 protected:
-    void SetUp() override {
-        struct sigaction sa {};
-        sa.sa_handler = &Timer::AlarmHandler;
-        sigemptyset(&sa.sa_mask);
-        sigaction(SIGALRM, &sa, &saved_);
-    }
     void TearDown() override {
         gPalWakeStandInEnabled.store(true);
         gWakeSyscallNr.store(savedNr_);
-        sigaction(SIGALRM, &saved_, nullptr);
     }
-    struct sigaction saved_ {};
     int32_t savedNr_ = gWakeSyscallNr.load();
 };
 
-// A registered thread that sleeps once per round (Go) until `deadline`, or
-// ten seconds ahead when it is 0, and reports each result.
+timespec At(uint64_t ns) { return timespec{static_cast<time_t>(ns / 1000000000ull), static_cast<long>(ns % 1000000000ull)}; }
+
+// A thread that sleeps once per round (Go) on a wake word until `deadline`,
+// or ten seconds ahead when it is 0, and reports each result. The snapshot is
+// taken when the round starts, as the timer takes it with its expiry.
 struct Sleeper {
-    std::atomic<int32_t> tid{0};
+    PalWakeWord word;
     std::atomic<int> go{0}, started{0}, done{0};
     std::atomic<PalSleepResult> last{PalSleepResult::kFailed};
     std::atomic<uint64_t> deadline{0}, returnedAt{0};
-    std::atomic<bool> clearFirst{true};  // drop a stale wake before sleeping
     std::atomic<bool> quit{false};
     std::thread thread{[this] {
-        PalWakeSlot* slot = PalWakeRegister();
-        tid.store(slot ? Tid() : -1);
         for (;;) {
             while (go.load() == started.load() && !quit.load()) std::this_thread::yield();
             if (quit.load()) break;
-            if (clearFirst.load()) PalWakeClear(slot);
+            const uint32_t snapshot = PalWakeSnapshot(word);
             const uint64_t d = deadline.load() ? deadline.load() : MonoNowNs() + 10000 * kMs;
             started.fetch_add(1);
-            const timespec ts{static_cast<time_t>(d / 1000000000ull), static_cast<long>(d % 1000000000ull)};
-            last.store(PalWakeableSleepUntil(slot, ts));
+            last.store(PalWakeableSleepUntil(word, snapshot, At(d)));
             returnedAt.store(MonoNowNs());
             done.fetch_add(1);
         }
-        PalWakeUnregister(slot);
     }};
 
-    Sleeper() {
-        while (tid.load() == 0) std::this_thread::yield();
-    }
     ~Sleeper() {
         quit.store(true);
         thread.join();
     }
-    void Go(int round) {  // returns as the thread is about to sleep
+    void Go(int round) {  // returns once the snapshot is taken
         go.store(round);
         while (started.load() < round) std::this_thread::yield();
     }
@@ -96,15 +80,20 @@ struct Sleeper {
     }
 };
 
+void IgnoreAlarm(int) {}
+
 // --- the wake stand-in ------------------------------------------------------
 
-// One sleeper through three rounds: a deadline is never served early, and
-// plain SIGALRMs (another user of the signal) do not end the sleep; a wake
-// ends a ten-second sleep promptly; a wake requested while the thread is not
-// sleeping is not lost, the next sleep (not clearing it first) ends at once.
-TEST_F(WakeFixture, DeadlineWakeAndPendingWake) {
+// A deadline is served, never early, and signals (another user of SIGALRM)
+// do not end the sleep; a wake ends a ten-second sleep promptly; a wake that
+// lands after the snapshot but before the sleep begins is not lost: that
+// sleep does not start.
+TEST_F(WakeFixture, DeadlineWakeAndAWakeBeforeTheSleep) {
+    struct sigaction ignore {}, saved {};
+    ignore.sa_handler = &IgnoreAlarm;
+    sigemptyset(&ignore.sa_mask);
+    sigaction(SIGALRM, &ignore, &saved);
     Sleeper s;
-    ASSERT_GT(s.tid.load(), 0);
     const uint64_t deadline = MonoNowNs() + 80 * kMs;
     s.deadline.store(deadline);
     s.Go(1);
@@ -113,6 +102,7 @@ TEST_F(WakeFixture, DeadlineWakeAndPendingWake) {
         usleep(5000);
     }
     ASSERT_TRUE(s.WaitDone(1));
+    sigaction(SIGALRM, &saved, nullptr);
     EXPECT_EQ(s.last.load(), PalSleepResult::kDeadline);
     EXPECT_GE(s.returnedAt.load(), deadline);
     EXPECT_LT(s.returnedAt.load() - deadline, 50 * kMs);
@@ -121,105 +111,58 @@ TEST_F(WakeFixture, DeadlineWakeAndPendingWake) {
     s.Go(2);
     usleep(20000);
     const uint64_t woke = MonoNowNs();
-    EXPECT_EQ(PalWakeThreadId(s.tid.load()), 0);
+    PalWake(s.word);
     ASSERT_TRUE(s.WaitDone(2));
     EXPECT_EQ(s.last.load(), PalSleepResult::kWoken);
     printf("stand-in wake latency: %.1f us\n", (s.returnedAt.load() - woke) / 1e3);
 
-    s.clearFirst.store(false);
-    EXPECT_EQ(PalWakeThreadId(s.tid.load()), 0);
-    usleep(5000);
-    s.Go(3);
-    ASSERT_TRUE(s.WaitDone(3));
-    EXPECT_EQ(s.last.load(), PalSleepResult::kWoken);
+    // The snapshot predates the wake: the sleep returns at once, whatever the
+    // thread did in between.
+    PalWakeWord word;
+    const uint32_t snapshot = PalWakeSnapshot(word);
+    PalWake(word);
+    const uint64_t t0 = MonoNowNs();
+    EXPECT_EQ(PalWakeableSleepUntil(word, snapshot, At(t0 + 10000 * kMs)), PalSleepResult::kWoken);
+    EXPECT_LT(MonoNowNs() - t0, 50 * kMs);
+    // A deadline already past is served at once.
+    EXPECT_EQ(PalWakeableSleepUntil(word, PalWakeSnapshot(word), At(t0)), PalSleepResult::kDeadline);
 }
 
-// Wakes fired at every moment around the start of a sleep, including between
-// the sleeper's flag check and its system call: no sleep may run on to its
-// ten-second deadline. Under TSan a signal handler runs only at the next call
-// TSan intercepts, and clock_nanosleep is not one, so a wake landing just
-// before the system call waits for the sleep to end: there the rounds sleep
-// 20 ms and only the race detection applies.
+// Wakes fired at every moment around the start of a sleep: no sleep may run
+// on to its ten-second deadline.
 TEST_F(WakeFixture, WakesRacingTheStartOfASleepAreNeverLost) {
-#if defined(__SANITIZE_THREAD__)
-    constexpr bool kDeferredSignals = true;
-#else
-    constexpr bool kDeferredSignals = false;
-#endif
     Sleeper s;
     uint32_t spin = 0;
-    for (int r = 1; r <= 400; ++r) {
-        if (kDeferredSignals) s.deadline.store(MonoNowNs() + 20 * kMs);
+    for (int r = 1; r <= 2000; ++r) {
         s.Go(r);
         spin = spin * 1103515245u + 12345u;
         for (volatile uint32_t i = 0, n = (spin >> 16) % 4000; i < n; ++i) {
         }
-        ASSERT_EQ(PalWakeThreadId(s.tid.load()), 0);
+        PalWake(s.word);
         ASSERT_TRUE(s.WaitDone(r, 3000 * kMs)) << "round " << r << " missed its wake";
-        ASSERT_TRUE(kDeferredSignals || s.last.load() == PalSleepResult::kWoken) << "round " << r;
+        ASSERT_EQ(s.last.load(), PalSleepResult::kWoken) << "round " << r;
     }
-}
-
-// The same window hit on purpose: the wake (flag and signal) lands after the
-// sleeper's last check, right before its system call. The signal to oneself
-// is taken before pthread_kill returns, so only the handler's zeroing of the
-// pending request keeps the thread from sleeping to the old deadline.
-std::atomic<int32_t> gWindowTid{0};
-std::atomic<int> gWindowHits{0};
-void WakeInWindow() {
-    if (Tid() != gWindowTid.load()) return;
-    gWindowHits.fetch_add(1);
-    PalWakeThreadId(gWindowTid.load());
-}
-
-TEST_F(WakeFixture, WakeBetweenLastCheckAndSystemCallEndsTheSleep) {
-    Sleeper s;
-    gWindowTid.store(s.tid.load());
-    gWindowHits.store(0);
-    gPalWakeWindowHook.store(&WakeInWindow);
-    s.Go(1);
-    const bool done = s.WaitDone(1, 3000 * kMs);
-    gPalWakeWindowHook.store(nullptr);
-    if (!done) PalWakeThreadId(s.tid.load());  // release it so the test can end
-    ASSERT_TRUE(done) << "the wake in the window was lost";
-    EXPECT_EQ(gWindowHits.load(), 1);
-    EXPECT_EQ(s.last.load(), PalSleepResult::kWoken);
 }
 
 // The dispatch: a wake number below 1 means no kernel call, so the stand-in
-// serves (or refuses with 38 when switched off, unless forced as for a
-// timer's own shutdown); otherwise that system call gets the thread id.
+// serves (or refuses with 38 when switched off); otherwise that system call
+// gets the timer thread's id.
 TEST_F(WakeFixture, DispatchAndWhatTheStandInRefuses) {
-    EXPECT_EQ(PalWakeThreadId(Tid()), 38) << "not a registered thread";
-    EXPECT_EQ(PalWakeThreadId(-1, true), 38);
-    int32_t tid = 0;
-    {
-        Sleeper s;
-        tid = s.tid.load();
-        for (int32_t nr : {-1, 0, -17}) {
-            gWakeSyscallNr.store(nr);
-            EXPECT_EQ(WakeTimerThread(tid), 0) << nr;
-            gPalWakeStandInEnabled.store(false);
-            EXPECT_EQ(WakeTimerThread(tid), 38) << nr;
-            EXPECT_EQ(PalWakeThreadId(tid, true), 0) << nr;
-            gPalWakeStandInEnabled.store(true);
-        }
-        gWakeSyscallNr.store(SYS_getppid);  // ignores its argument and is harmless
-        EXPECT_EQ(WakeTimerThread(12345), static_cast<int32_t>(getppid()));
+    TimerThreadState state;
+    state.threadId.store(12345);
+    for (int32_t nr : {-1, 0, -17}) {
+        gWakeSyscallNr.store(nr);
+        const uint32_t before = PalWakeSnapshot(state.wakeWord);
+        EXPECT_EQ(WakeTimerThread(state), 0) << nr;
+        EXPECT_NE(PalWakeSnapshot(state.wakeWord), before) << "the stand-in did not move the word";
+        gPalWakeStandInEnabled.store(false);
+        EXPECT_EQ(WakeTimerThread(state), 38) << nr;
+        gPalWakeStandInEnabled.store(true);
     }
-    EXPECT_EQ(PalWakeThreadId(tid, true), 38) << "an unregistered thread can no longer be named";
-
-    // The slot table is bounded and its slots are reused.
-    std::vector<PalWakeSlot*> taken;
-    while (PalWakeSlot* slot = PalWakeRegister()) {
-        taken.push_back(slot);
-        ASSERT_LE(taken.size(), 1024u);
-    }
-    EXPECT_GE(taken.size(), 1u);
-    for (PalWakeSlot* slot : taken) PalWakeUnregister(slot);
-    PalWakeSlot* again = PalWakeRegister();
-    EXPECT_NE(again, nullptr);
-    PalWakeUnregister(again);
+    gWakeSyscallNr.store(SYS_getppid);  // ignores its argument and is harmless
+    const uint32_t before = PalWakeSnapshot(state.wakeWord);
+    EXPECT_EQ(WakeTimerThread(state), static_cast<int32_t>(getppid()));
+    EXPECT_EQ(PalWakeSnapshot(state.wakeWord), before) << "the kernel call serves alone";
 }
 
 // --- slots without a thread ---------------------------------------------------

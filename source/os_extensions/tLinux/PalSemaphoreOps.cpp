@@ -56,6 +56,18 @@ uint32_t PalSemaphoreWaitUntil(PalSemaphore* semaphore, const timespec* deadline
     return quelta_runtime::SemaphoreWaitUntil(semaphore, deadline);
 }
 
+uint32_t PalSemaphoreWaitUntilUnless(PalSemaphore* semaphore, const timespec* deadline, bool (*abandon)()) {
+    if (semaphore == nullptr) return 2;
+    return quelta_runtime::SemaphoreWaitUntilUnless(semaphore, deadline, abandon);
+}
+
+void PalSemaphoreWakeAll(PalSemaphore* semaphore) {
+    if (semaphore == nullptr) return;
+    pthread_mutex_lock(&semaphore->mutex);
+    pthread_cond_broadcast(&semaphore->condition);
+    pthread_mutex_unlock(&semaphore->mutex);
+}
+
 int32_t PalSemaphorePost(PalSemaphore* semaphore) {
     if (semaphore == nullptr) return EINVAL;
     return quelta_runtime::SemaphorePost(semaphore);

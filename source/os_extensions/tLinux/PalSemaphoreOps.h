@@ -20,7 +20,13 @@ uint32_t PalSemaphoreWait(PalSemaphore* semaphore, int32_t timeoutMs);
 // none). The waiter's own kernel timer ends the wait, so a wait bounded by a
 // known deadline needs no second thread to wake it.
 uint32_t PalSemaphoreWaitUntil(PalSemaphore* semaphore, const timespec* deadline);
+// As PalSemaphoreWaitUntil, but gives up (result 3, no post taken) as soon as
+// `abandon()` returns true; it is asked under the semaphore's mutex before the
+// wait and after every wake-up (PalSemaphoreWakeAll makes one).
+uint32_t PalSemaphoreWaitUntilUnless(PalSemaphore* semaphore, const timespec* deadline, bool (*abandon)());
 int32_t PalSemaphorePost(PalSemaphore* semaphore);
+// Wakes every waiter without posting: each looks at its own reason to go on.
+void PalSemaphoreWakeAll(PalSemaphore* semaphore);
 int32_t PalSemaphoreDestroy(PalSemaphore* semaphore);
 
 }  // namespace quelta

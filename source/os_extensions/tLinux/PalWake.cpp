@@ -1,149 +1,98 @@
-// User-space stand-in for the kernel's sched_wake_up call.
-//
-// A wake is a request flag plus SIGALRM. The flag alone cannot end a sleep
-// that has already begun, and the signal alone cannot tell a wake from any
-// other SIGALRM (a plain EINTR must resume the sleep). Together they still
-// leave a window: a signal that lands after the sleeper checked the flag but
-// before it entered clock_nanosleep would run its handler and then let the
-// sleeper sleep to the old deadline. The handler closes that window by zeroing
-// the sleeper's published request, so the system call finds a deadline that
-// has long passed and returns at once. The sleeper keeps its own copy of the
-// deadline, so a zeroed request never turns into an early "deadline came".
+// The futex behind the wakeable sleep (see PalWake.h).
 #include "tLinux/PalWake.h"
 
 #include <errno.h>
-#include <signal.h>
+#include <linux/futex.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
 namespace quelta {
 
-// One registered sleeper. Free while owner is 0; -1 while being claimed.
-struct PalWakeSlot {
-    std::atomic<int32_t> owner{0};            // kernel thread id of the sleeper
-    std::atomic<pthread_t> thread{};          // its pthread handle, for pthread_kill
-    std::atomic<uint32_t> wakeRequested{0};   // set by a waker, cleared by the sleeper
-    std::atomic<timespec*> request{nullptr};  // the sleeper's pending request, if any
-};
-
-static_assert(std::atomic<int32_t>::is_always_lock_free &&
-                  std::atomic<uint32_t>::is_always_lock_free &&
-                  std::atomic<timespec*>::is_always_lock_free,
-              "the signal handler may only touch lock-free atomics");
+std::atomic<bool> gPalWakeStandInEnabled{true};
 
 namespace {
 
-// Timers are few (one per loaded library, a handful in tests); a fixed table
-// keeps registration allocation-free and lets the signal handler scan it.
-constexpr int kWakeSlots = 32;
-PalWakeSlot gWakeSlots[kWakeSlots];
+constexpr int kWaitOp = FUTEX_WAIT_BITSET | FUTEX_PRIVATE_FLAG;  // absolute, CLOCK_MONOTONIC
+constexpr int kWakeOp = FUTEX_WAKE | FUTEX_PRIVATE_FLAG;
 
-int32_t CurrentTid() { return static_cast<int32_t>(syscall(SYS_gettid)); }
+uint32_t* Address(PalWakeWord& word) { return reinterpret_cast<uint32_t*>(&word.sequence); }
 
-bool Before(const timespec& a, const timespec& b) {
-    if (a.tv_sec != b.tv_sec) return a.tv_sec < b.tv_sec;
-    return a.tv_nsec < b.tv_nsec;
+// The kernel's time point layouts: the 64-bit one of the time64 calls (and of
+// every call on a 64-bit kernel ABI), and the 32-bit one of the original
+// calls on 32-bit targets. They are spelled out here because the C library's
+// struct timespec follows the build's time_t, which need not match either.
+struct KernelTimespec64 {
+    int64_t tv_sec;
+    int64_t tv_nsec;
+};
+struct KernelTimespec32 {
+    int32_t tv_sec;
+    int32_t tv_nsec;
+};
+
+// One futex wait; returns 0 or an errno value.
+int FutexWaitUntil(PalWakeWord& word, uint32_t expected, const timespec& deadline) {
+#if defined(__LP64__)
+    const KernelTimespec64 ts{static_cast<int64_t>(deadline.tv_sec), static_cast<int64_t>(deadline.tv_nsec)};
+    if (syscall(SYS_futex, Address(word), kWaitOp, expected, &ts, nullptr, FUTEX_BITSET_MATCH_ANY) == 0) return 0;
+    return errno;
+#else
+#if defined(__NR_futex_time64)
+    // The time64 call where the kernel has it (5.1 and later); the original
+    // call, with 32-bit seconds, otherwise.
+    static std::atomic<bool> sNoTime64{false};
+    if (!sNoTime64.load(std::memory_order_relaxed)) {
+        const KernelTimespec64 ts{static_cast<int64_t>(deadline.tv_sec), static_cast<int64_t>(deadline.tv_nsec)};
+        if (syscall(__NR_futex_time64, Address(word), kWaitOp, expected, &ts, nullptr, FUTEX_BITSET_MATCH_ANY) == 0) {
+            return 0;
+        }
+        const int err = errno;
+        if (err != ENOSYS) return err;
+        sNoTime64.store(true, std::memory_order_relaxed);
+    }
+#endif
+    const KernelTimespec32 ts{static_cast<int32_t>(deadline.tv_sec), static_cast<int32_t>(deadline.tv_nsec)};
+    if (syscall(__NR_futex, Address(word), kWaitOp, expected, &ts, nullptr, FUTEX_BITSET_MATCH_ANY) == 0) return 0;
+    return errno;
+#endif
 }
 
-PalWakeSlot* FindSlot(int32_t tid) {
-    if (tid <= 0) return nullptr;
-    for (PalWakeSlot& slot : gWakeSlots) {
-        if (slot.owner.load(std::memory_order_acquire) == tid) return &slot;
-    }
-    return nullptr;
+bool Reached(const timespec& deadline) {
+    timespec now{};
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    if (now.tv_sec != deadline.tv_sec) return now.tv_sec > deadline.tv_sec;
+    return now.tv_nsec >= deadline.tv_nsec;
 }
 
 }  // namespace
 
-std::atomic<bool> gPalWakeStandInEnabled{true};
-std::atomic<void (*)()> gPalWakeWindowHook{nullptr};
-
-PalWakeSlot* PalWakeRegister() {
-    const int32_t tid = CurrentTid();
-    for (PalWakeSlot& slot : gWakeSlots) {
-        int32_t expected = 0;
-        if (!slot.owner.compare_exchange_strong(expected, -1)) continue;
-        slot.thread.store(pthread_self(), std::memory_order_relaxed);
-        slot.wakeRequested.store(0, std::memory_order_relaxed);
-        slot.request.store(nullptr, std::memory_order_relaxed);
-        // Publishing the id makes the slot visible to wakers and the handler,
-        // with its handle already in place.
-        slot.owner.store(tid, std::memory_order_release);
-        return &slot;
-    }
-    return nullptr;
-}
-
-void PalWakeUnregister(PalWakeSlot* slot) {
-    if (slot == nullptr) return;
-    slot->request.store(nullptr);
-    slot->wakeRequested.store(0);
-    slot->owner.store(0, std::memory_order_release);
-}
-
-void PalWakeClear(PalWakeSlot* slot) {
-    if (slot != nullptr) slot->wakeRequested.store(0);
-}
-
-PalSleepResult PalWakeableSleepUntil(PalWakeSlot* slot, const timespec& deadline) {
-    timespec req;
+PalSleepResult PalWakeableSleepUntil(PalWakeWord& word, uint32_t snapshot, const timespec& deadline,
+                                     bool (*interrupted)(void*), void* context) {
     for (;;) {
-        req = deadline;
-        int rc;
-        if (slot != nullptr) {
-            // Publish first, then look at the flag: a wake set after this
-            // check either interrupts the system call or, landing before it,
-            // has its handler zero `req`.
-            slot->request.store(&req);
-            if (slot->wakeRequested.load() != 0) {
-                slot->request.store(nullptr);
-                return PalSleepResult::kWoken;
-            }
-            if (void (*hook)() = gPalWakeWindowHook.load(std::memory_order_relaxed)) hook();
-            rc = clock_nanosleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &req, nullptr);
-            slot->request.store(nullptr);
-        } else {
-            rc = clock_nanosleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &req, nullptr);
+        if (word.sequence.load(std::memory_order_acquire) != snapshot) return PalSleepResult::kWoken;
+        const int rc = FutexWaitUntil(word, snapshot, deadline);
+        switch (rc) {
+            case ETIMEDOUT:
+                // The kernel's timer has expired, so the clock has passed the
+                // deadline; the check only guards against a kernel that says
+                // otherwise.
+                if (Reached(deadline)) return PalSleepResult::kDeadline;
+                break;
+            case 0:       // woken: by a waker, or spuriously (the word tells)
+            case EAGAIN:  // the word had moved before the kernel looked
+                break;
+            case EINTR:
+                if (interrupted != nullptr && interrupted(context)) return PalSleepResult::kWoken;
+                break;
+            default:
+                return PalSleepResult::kFailed;
         }
-        const bool woken = slot != nullptr && slot->wakeRequested.load() != 0;
-        if (rc == 0) {
-            timespec now;
-            clock_gettime(CLOCK_MONOTONIC, &now);
-            if (!Before(now, deadline)) return PalSleepResult::kDeadline;
-            if (woken) return PalSleepResult::kWoken;
-            continue;  // request zeroed by a stale signal: the deadline stands
-        }
-        if (rc == EINTR) {
-            if (woken) return PalSleepResult::kWoken;
-            continue;  // any other signal: resume the same sleep
-        }
-        return PalSleepResult::kFailed;
     }
 }
 
-int32_t PalWakeThreadId(int32_t threadId, bool force) {
-    if (!force && !gPalWakeStandInEnabled.load(std::memory_order_relaxed)) return ENOSYS;
-    PalWakeSlot* slot = FindSlot(threadId);
-    if (slot == nullptr) return ENOSYS;
-    slot->wakeRequested.store(1);
-    // The sleeper publishes its request before it looks at the flag, and we
-    // set the flag before we look at the request: if we find none, the
-    // sleeper is not sleeping and will see the flag before its next sleep, so
-    // the signal (which would only interrupt whatever it is doing) is spared.
-    if (slot->request.load() == nullptr) return 0;
-    return pthread_kill(slot->thread.load(std::memory_order_relaxed), SIGALRM);
-}
-
-void PalWakeOnSignal() {
-    PalWakeSlot* slot = FindSlot(CurrentTid());
-    if (slot == nullptr || slot->wakeRequested.load() == 0) return;
-    timespec* req = slot->request.load();
-    if (req == nullptr) return;
-    // The request lives on this very thread's stack (the handler interrupted
-    // its owner), so plain stores are enough; volatile keeps them in place.
-    volatile timespec* target = req;
-    target->tv_sec = 0;
-    target->tv_nsec = 0;
+void PalWake(PalWakeWord& word) {
+    word.sequence.fetch_add(1, std::memory_order_release);
+    syscall(SYS_futex, Address(word), kWakeOp, INT32_MAX, nullptr, nullptr, 0);
 }
 
 }  // namespace quelta

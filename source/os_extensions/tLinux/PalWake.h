@@ -1,18 +1,21 @@
-// Platform layer: a user-space stand-in for the kernel's sched_wake_up call.
+// Platform layer: a sleep until an absolute CLOCK_MONOTONIC deadline that
+// another thread can end at any instant, without a lost wake.
 //
-// Ends a registered thread's current clock_nanosleep promptly, including when
-// the wake lands just before the thread enters its sleep. A sleeper registers
-// a PalWakeSlot, sleeps with PalWakeableSleepUntil, and the waker calls
-// PalWakeThreadId. The wake is carried by a request flag plus SIGALRM; the
-// signal handler zeroes the sleeper's pending request so that a wake landing
-// between the sleeper's last check and its system call still ends the sleep.
-// The process's SIGALRM handler must call PalWakeOnSignal (the timer's does).
-// A waker may only name a thread that stays registered until the wake is
-// sent (the timer guarantees it: its thread unregisters only when it ends).
+// Stands in for the kernel's sched_wake_up call on kernels that lack it. The
+// sleeper takes a snapshot of a wake word at the moment it takes its work
+// (under the same lock as the work itself) and sleeps on the word; a waker
+// changes the word after it has handed over new work and then wakes the
+// word's sleepers. The kernel compares the word with the snapshot atomically
+// with putting the sleeper to sleep, so a wake that lands anywhere after the
+// snapshot, including between the sleeper's last instruction and the kernel's
+// own test, ends (or prevents) that sleep. No signal is involved, and nothing
+// of the sleeper's state is edited behind its back.
+//
+// The sleep is a futex wait with an absolute CLOCK_MONOTONIC timeout: the same
+// high-resolution kernel timer as clock_nanosleep, with the same precision.
 #ifndef QUELTA_TLINUX_PALWAKE_H
 #define QUELTA_TLINUX_PALWAKE_H
 
-#include <pthread.h>
 #include <time.h>
 
 #include <atomic>
@@ -20,46 +23,42 @@
 
 namespace quelta {
 
-struct PalWakeSlot;
+// The word a sleeper waits on. Wakers increment it (release); the sleeper
+// reads it (acquire) when it takes its work. Wraps harmlessly: only equality
+// with the snapshot matters.
+struct PalWakeWord {
+    std::atomic<uint32_t> sequence{0};
+};
+
+static_assert(sizeof(std::atomic<uint32_t>) == sizeof(uint32_t) &&
+                  std::atomic<uint32_t>::is_always_lock_free,
+              "the kernel waits on the word itself");
 
 // Result of a wakeable sleep.
 enum class PalSleepResult {
-    kDeadline,  // the deadline came (clock_nanosleep returned 0 at or after it)
-    kWoken,     // a wake request ended (or prevented) the sleep
-    kFailed,    // clock_nanosleep failed with something other than EINTR
+    kDeadline,  // the clock has reached the deadline
+    kWoken,     // the word moved past the snapshot (before or during the sleep)
+    kFailed,    // the kernel refused the sleep
 };
 
-// Claims a slot for the calling thread (call on the sleeping thread itself).
-// Null when all slots are taken (the thread then cannot be woken early).
-PalWakeSlot* PalWakeRegister();
-void PalWakeUnregister(PalWakeSlot* slot);
+// The snapshot to sleep on: take it together with the work it covers.
+inline uint32_t PalWakeSnapshot(const PalWakeWord& word) {
+    return word.sequence.load(std::memory_order_acquire);
+}
 
-// Sleeps on CLOCK_MONOTONIC until the absolute deadline; EINTR without a wake
-// request resumes the same sleep. A pending wake request returns kWoken at once.
-// kDeadline is returned only once the clock has reached the deadline, never
-// for a request zeroed by the handler. A null slot sleeps unwakeably.
-PalSleepResult PalWakeableSleepUntil(PalWakeSlot* slot, const timespec& deadline);
+// Sleeps until `deadline` on CLOCK_MONOTONIC unless the word moves past
+// `snapshot`. Signals (EINTR) and spurious wake-ups resume the same sleep;
+// `interrupted`, when given, is asked after each signal and ends the sleep
+// with kWoken when it returns true. kDeadline is returned only once the
+// clock has reached the deadline.
+PalSleepResult PalWakeableSleepUntil(PalWakeWord& word, uint32_t snapshot, const timespec& deadline,
+                                     bool (*interrupted)(void*) = nullptr, void* context = nullptr);
 
-// Clears a pending wake request (the sleeper calls it when it takes new work).
-void PalWakeClear(PalWakeSlot* slot);
-
-// Requests a wake of the registered thread with kernel id `threadId`: sets
-// its request flag and, if the thread is inside PalWakeableSleepUntil, sends
-// it SIGALRM. Returns 0 (or pthread_kill's error), or 38 (ENOSYS) when the
-// stand-in cannot serve (no such registered thread, or switched off through
-// the seam; `force` ignores the seam, for a timer's own shutdown).
-int32_t PalWakeThreadId(int32_t threadId, bool force = false);
-
-// The SIGALRM handler's work for the stand-in (async-signal-safe).
-void PalWakeOnSignal();
+// Moves the word on and wakes every thread sleeping on it.
+void PalWake(PalWakeWord& word);
 
 // Seam: tests switch the stand-in off to exercise the plain SIGALRM fallback.
 extern std::atomic<bool> gPalWakeStandInEnabled;
-
-// Seam: when set, called on the sleeping thread after its last look at the
-// wake request and right before clock_nanosleep, so that tests can land a
-// wake in that window deterministically. Null in the product.
-extern std::atomic<void (*)()> gPalWakeWindowHook;
 
 }  // namespace quelta
 

@@ -22,15 +22,22 @@ namespace {
 
 constexpr int32_t kNoSyscall = ENOSYS;  // 38: neither the kernel call nor the stand-in
 constexpr uint64_t kNsPerSecond = 1000000000ull;
-constexpr long kStartWaitStepNs = 200 * 1000;               // 200 us
-constexpr int kStartWaitSteps = 5000;                       // 1 s in all
-constexpr long kSlotlessKickNs = 1000 * 1000;               // 1 ms
+constexpr long kStartWaitStepNs = 200 * 1000;  // 200 us
+constexpr int kStartWaitSteps = 5000;          // 1 s in all
+constexpr long kJoinPollNs = 100 * 1000;       // 100 us
+constexpr int kJoinPollsPerKick = 10;          // SIGALRM to a plain sleep every 1 ms
 
-// The SIGALRM action that was installed before the first live timer, restored
-// when the last one is gone. Guarded by gAlarmMutex.
+// The SIGALRM action that was installed before the first live timer, put
+// back when the last one is gone if ours is still the one installed.
+// Guarded by gAlarmMutex.
 pthread_mutex_t gAlarmMutex = PTHREAD_MUTEX_INITIALIZER;
 struct sigaction gSavedAlarmAction;
 uint32_t gAlarmUsers = 0;
+
+// The timer whose thread this is, on a timer thread; null elsewhere. Lets
+// SetExpiry see that it is called from the callback without asking the
+// kernel for the thread id on every re-arm.
+thread_local const TimerThreadState* tCurrentTimerState = nullptr;
 
 void SleepNs(long ns) {
     timespec ts{0, ns};
@@ -43,16 +50,44 @@ void SetStatus(TimerThreadState& state, TimerThreadStatus status) {
     state.status.store(static_cast<int32_t>(status));
 }
 
-// A sleep for a thread that found no wake slot: nothing but a signal can end
-// it early, so an interrupted sleep looks at stopRequested before it resumes
-// (otherwise the destructor could not release a parked thread).
-PalSleepResult SleepWithoutSlot(TimerThreadState& state, const timespec& deadline) {
+void SetSleepKind(TimerThreadState& state, TimerSleepKind kind) {
+    state.sleepKind.store(static_cast<int32_t>(kind));
+}
+
+bool StopRequested(void* state) { return static_cast<TimerThreadState*>(state)->stopRequested.load() != 0; }
+
+// A plain absolute clock_nanosleep. Result 0 is the deadline; a signal
+// resumes the same sleep (only a stop ends it, so that the destructor can
+// release a thread parked on the far deadline); with the kernel's wake-up
+// call configured, any other result means "woken: take the new expiry".
+PalSleepResult NanosleepUntil(TimerThreadState& state, const timespec& deadline, bool kernelWake) {
     for (;;) {
         const int rc = clock_nanosleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &deadline, nullptr);
         if (rc == 0) return PalSleepResult::kDeadline;
-        if (rc != EINTR) return PalSleepResult::kFailed;
-        if (state.stopRequested.load() != 0) return PalSleepResult::kWoken;
+        if (rc == EINTR) {
+            if (StopRequested(&state)) return PalSleepResult::kWoken;
+            continue;
+        }
+        return kernelWake ? PalSleepResult::kWoken : PalSleepResult::kFailed;
     }
+}
+
+// One sleep of the timer thread until `deadline`, by the means that its
+// wakers use right now.
+PalSleepResult SleepUntil(TimerThreadState& state, uint32_t snapshot, const timespec& deadline) {
+    PalSleepResult result;
+    if (gWakeSyscallNr.load(std::memory_order_relaxed) >= 1) {
+        SetSleepKind(state, TimerSleepKind::kNanosleep);
+        result = NanosleepUntil(state, deadline, true);
+    } else if (gPalWakeStandInEnabled.load(std::memory_order_relaxed)) {
+        SetSleepKind(state, TimerSleepKind::kWakeWord);
+        result = PalWakeableSleepUntil(state.wakeWord, snapshot, deadline, &StopRequested, &state);
+    } else {
+        SetSleepKind(state, TimerSleepKind::kNanosleep);
+        result = NanosleepUntil(state, deadline, false);
+    }
+    SetSleepKind(state, TimerSleepKind::kAwake);
+    return result;
 }
 
 void* TimerThreadStart(void* arg) {
@@ -61,10 +96,12 @@ void* TimerThreadStart(void* arg) {
 
 }  // namespace
 
-int32_t WakeTimerThread(int32_t threadId) {
+int32_t WakeTimerThread(TimerThreadState& state) {
     const int32_t nr = gWakeSyscallNr.load(std::memory_order_relaxed);
-    if (nr >= 1) return static_cast<int32_t>(syscall(nr, threadId));
-    return PalWakeThreadId(threadId);
+    if (nr >= 1) return static_cast<int32_t>(syscall(nr, state.threadId.load()));
+    if (!gPalWakeStandInEnabled.load(std::memory_order_relaxed)) return kNoSyscall;
+    PalWake(state.wakeWord);
+    return 0;
 }
 
 tKPusLinuxNanoSleepTimer::tKPusLinuxNanoSleepTimer() : alarmAction(), thread(0), threadAttr() {
@@ -130,10 +167,10 @@ void tKPusLinuxNanoSleepTimer::SetExpiry(ClockTime when) {
     state.expiry.tv_nsec = static_cast<int32_t>(ns - seconds * kNsPerSecond);
 
     // Wake the thread while still holding the lock: it cannot take the new
-    // value before the wake request is in place.
-    const int32_t tid = state.threadId.load();
-    if (tid >= 0 && tid != PalGetThreadId()) {
-        if (WakeTimerThread(tid) == kNoSyscall) {
+    // value without also seeing the wake (its snapshot of the wake word is
+    // taken under the same lock).
+    if (state.threadId.load() >= 0 && !OnTimerThread()) {
+        if (WakeTimerThread(state) == kNoSyscall) {
             if (gWakeWarningShown.exchange(1) == 0) {
                 std::printf(
                     "Warning: using sched_wake_up system call %d failed!\n"
@@ -155,41 +192,48 @@ bool tKPusLinuxNanoSleepTimer::IsServing() const {
     return StatusOf(state) == static_cast<int32_t>(TimerThreadStatus::kServing);
 }
 
+bool tKPusLinuxNanoSleepTimer::OnTimerThread() const { return tCurrentTimerState == &state; }
+
 tKPusLinuxNanoSleepTimer::~tKPusLinuxNanoSleepTimer() {
     if (thread != 0) {
         state.stopRequested.store(1);
         // A thread parked on the far deadline would otherwise keep the join
-        // waiting for decades. The wake ignores the stand-in's switch: it is
-        // the timer's own shutdown, not a deadline change.
-        bool joined = false;
+        // waiting for decades. The wake word ends a stand-in sleep whatever
+        // the seam says; the kernel call, when configured, ends its sleep; a
+        // plain clock_nanosleep (the fallback) is kicked with SIGALRM until
+        // the thread has seen the stop.
+        PalWake(state.wakeWord);
+        const int32_t nr = gWakeSyscallNr.load();
         const int32_t tid = state.threadId.load();
-        if (tid >= 0 && PalWakeThreadId(tid, true) != 0 &&
-            state.wakeSlot.load() == nullptr) {
-            // No wake slot: the thread checks stopRequested after every
-            // interrupted sleep, so keep interrupting until it has gone.
-            while (pthread_tryjoin_np(thread, nullptr) == EBUSY) {
+        if (nr >= 1 && tid > 0) syscall(nr, tid);
+        for (int poll = 1; pthread_tryjoin_np(thread, nullptr) == EBUSY; ++poll) {
+            if (poll % kJoinPollsPerKick == 0 &&
+                state.sleepKind.load() == static_cast<int32_t>(TimerSleepKind::kNanosleep)) {
                 pthread_kill(thread, SIGALRM);
-                SleepNs(kSlotlessKickNs);
             }
-            joined = true;
+            SleepNs(kJoinPollNs);
         }
-        if (!joined) pthread_join(thread, nullptr);
         thread = 0;
     }
     if (actionInstalled_) {
         pthread_mutex_lock(&gAlarmMutex);
-        if (--gAlarmUsers == 0) sigaction(SIGALRM, &gSavedAlarmAction, nullptr);
+        if (--gAlarmUsers == 0) {
+            // Put back what was there before us, unless the application has
+            // installed its own handler since: that one stays.
+            struct sigaction current {};
+            if (sigaction(SIGALRM, nullptr, &current) == 0 && (current.sa_flags & SA_SIGINFO) == 0 &&
+                current.sa_handler == &tKPusLinuxNanoSleepTimer::AlarmHandler) {
+                sigaction(SIGALRM, &gSavedAlarmAction, nullptr);
+            }
+        }
         pthread_mutex_unlock(&gAlarmMutex);
         actionInstalled_ = false;
     }
     pthread_rwlock_destroy(&state.expiryLock);
 }
 
-void tKPusLinuxNanoSleepTimer::AlarmHandler(int) {
-    const int savedErrno = errno;
-    PalWakeOnSignal();
-    errno = savedErrno;
-}
+// Does nothing: SIGALRM only has to end a plain clock_nanosleep with EINTR.
+void tKPusLinuxNanoSleepTimer::AlarmHandler(int) {}
 
 void* tKPusLinuxNanoSleepTimer::isrthread(TimerThreadState* state) {
     if (state == nullptr) return nullptr;
@@ -200,11 +244,7 @@ void* tKPusLinuxNanoSleepTimer::isrthread(TimerThreadState* state) {
 
     char name[16] = "QUELTAisr";
     PalSetThreadName(name);
-
-    // Registered before the id is published, so that no SetExpiry can find
-    // the id without finding the thread wakeable.
-    PalWakeSlot* slot = PalWakeRegister();
-    state->wakeSlot.store(slot);
+    tCurrentTimerState = state;
 
     sched_param param{};
     param.sched_priority = sched_get_priority_max(SCHED_FIFO);
@@ -216,8 +256,6 @@ void* tKPusLinuxNanoSleepTimer::isrthread(TimerThreadState* state) {
         PAL_DEBUG_PRINT("timer thread cannot get real-time priority (SCHED_FIFO %d, errno %d); "
                         "it serves no expiries",
                         param.sched_priority, err);
-        state->wakeSlot.store(nullptr);
-        PalWakeUnregister(slot);
         SetStatus(*state, TimerThreadStatus::kEnded);
         return nullptr;
     }
@@ -228,21 +266,19 @@ void* tKPusLinuxNanoSleepTimer::isrthread(TimerThreadState* state) {
     for (;;) {
         if (state->stopRequested.load() != 0) break;
 
-        // Take the deadline exactly once: whoever sets the next one wakes us.
+        // Take the deadline exactly once: whoever sets the next one moves
+        // the wake word after this snapshot, or set it before this take.
         pthread_rwlock_rdlock(&state->expiryLock);
+        const uint32_t snapshot = PalWakeSnapshot(state->wakeWord);
         const TimerTimespec taken = state->expiry;
         state->expiry = TimerTimespec{kParkedSeconds, 0};
-        PalWakeClear(slot);
         pthread_rwlock_unlock(&state->expiryLock);
-        // A stop whose wake request was just cleared above must still be seen.
         if (state->stopRequested.load() != 0) break;
 
-        timespec deadline;
+        timespec deadline{};
         deadline.tv_sec = taken.tv_sec;
         deadline.tv_nsec = taken.tv_nsec;
-        const PalSleepResult result = slot != nullptr ? PalWakeableSleepUntil(slot, deadline)
-                                                      : SleepWithoutSlot(*state, deadline);
-        if (result == PalSleepResult::kDeadline) {
+        if (SleepUntil(*state, snapshot, deadline) == PalSleepResult::kDeadline) {
             state->expiryCallback.load()();
         }
         // Woken or failed: go and take whatever expiry now holds (after the
@@ -250,8 +286,6 @@ void* tKPusLinuxNanoSleepTimer::isrthread(TimerThreadState* state) {
     }
 
     SetStatus(*state, TimerThreadStatus::kEnded);
-    state->wakeSlot.store(nullptr);
-    PalWakeUnregister(slot);
     return nullptr;
 }
 

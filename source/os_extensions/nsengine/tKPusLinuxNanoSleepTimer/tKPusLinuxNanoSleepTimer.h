@@ -4,7 +4,11 @@
 // Protocol: SetExpiry writes `expiry` under expiryLock held exclusively and
 // wakes the thread; the thread takes `expiry` (and resets it to the far value)
 // under the same lock in shared mode, so each deadline is taken exactly once.
-// The thread sleeps with clock_nanosleep on absolute CLOCK_MONOTONIC deadlines.
+// The thread sleeps on absolute CLOCK_MONOTONIC deadlines: with
+// clock_nanosleep when the kernel's wake-up call is configured (which ends
+// such a sleep), otherwise on the timer's wake word (tLinux/PalWake.h), whose
+// snapshot it takes together with the expiry, so that no setting made after
+// the take can miss the sleep that follows it.
 #ifndef QUELTA_NSENGINE_TKPUSLINUXNANOSLEEPTIMER_H
 #define QUELTA_NSENGINE_TKPUSLINUXNANOSLEEPTIMER_H
 
@@ -16,10 +20,10 @@
 #include <cstdint>
 
 #include "quelta/iKPusLinuxTimer.h"
+#include "tLinux/PalWake.h"
 
 namespace quelta {
 
-struct PalWakeSlot;
 
 // The far deadline that stands for an unarmed timer (about 68 years after the
 // monotonic clock's zero).
@@ -38,14 +42,26 @@ enum class TimerThreadStatus : int32_t {
     kEnded = 2,     // could not get SCHED_FIFO (or stopped): serves nothing
 };
 
+// How the timer thread sleeps right now; the destructor kicks a plain
+// clock_nanosleep with SIGALRM, which a wake-word sleep does not need.
+enum class TimerSleepKind : int32_t {
+    kAwake = 0,
+    kWakeWord = 1,   // the wake stand-in: ended by the wake word
+    kNanosleep = 2,  // clock_nanosleep: ended by the kernel call or, on stop, SIGALRM
+};
+
 struct TimerThreadState {
-    std::atomic<int32_t> threadId{-1};      // gettid of the timer thread
+    std::atomic<int32_t> threadId{-1};      // gettid of the timer thread; written once
     TimerTimespec expiry{kParkedSeconds, 0}; // guarded by expiryLock
     pthread_rwlock_t expiryLock;
-    std::atomic<uint8_t> stopRequested{0};
+    std::atomic<uint8_t> stopRequested{0};  // written once, by the destructor
     std::atomic<QueltaExpiryCallbackFn> expiryCallback{nullptr};
-    // Beyond the record proper: the wake stand-in's slot and the start status.
-    std::atomic<PalWakeSlot*> wakeSlot{nullptr};
+    // Beyond the record proper. The wake word moves, under expiryLock held
+    // exclusively, whenever SetExpiry hands the thread a new expiry through
+    // the stand-in (and once more on stop); the thread snapshots it under the
+    // lock in shared mode with each take.
+    PalWakeWord wakeWord;
+    std::atomic<int32_t> sleepKind{static_cast<int32_t>(TimerSleepKind::kAwake)};  // timer thread writes
     std::atomic<int32_t> status{static_cast<int32_t>(TimerThreadStatus::kStarting)};
 };
 
@@ -63,6 +79,9 @@ public:
     // True while the thread runs at top SCHED_FIFO priority and serves
     // expiries. A timer whose thread ended counts as no timer.
     bool IsServing() const;
+
+    // True on this timer's own thread (in its callback), without a system call.
+    bool OnTimerThread() const;
 
     static void* isrthread(TimerThreadState* state);
     static void AlarmHandler(int);
@@ -84,10 +103,11 @@ private:
 extern std::atomic<int32_t> gWakeSyscallNr;
 extern std::atomic<uint8_t> gWakeWarningShown;
 
-// Ends the timer thread's current sleep: the kernel call when its number is 1
-// or more, otherwise the platform layer's stand-in; 38 (ENOSYS) when neither
-// can serve.
-int32_t WakeTimerThread(int32_t threadId);
+// Ends the timer thread's current sleep: the kernel call with the thread's id
+// when its number is 1 or more (its result), otherwise the wake-word stand-in
+// (0); 38 (ENOSYS) when neither serves (the stand-in switched off through its
+// seam), which SetExpiry answers with SIGALRM.
+int32_t WakeTimerThread(TimerThreadState& state);
 
 }  // namespace quelta
 

@@ -1,0 +1,85 @@
+// Callers inside the library and the stop's way of getting them out (see
+// LibraryUse.h).
+#include "engine/LibraryUse.h"
+
+#include "engine/WaitList.h"
+#include "tLinux/PalSemaphoreOps.h"
+#include "tLinux/PalThreads.h"
+
+namespace quelta {
+
+std::atomic<bool> gStopping{false};
+std::atomic<int32_t> gCallersInside{0};
+
+namespace {
+
+// Semaphores that callers block on inside the library, guarded by
+// gSchedLock: a waiter lists its semaphore before it blocks and takes it off
+// before it returns, so the stop (which broadcasts under the same lock) never
+// touches a semaphore that its owner may already have destroyed. Room for
+// every node-using wait plus as many waits without a node; a waiter that
+// finds no room still waits, and the stop's grace period is then its bound.
+constexpr uint32_t kMaxBlocked = 2 * kWaitNodeCount;
+PalSemaphore* gBlocked[kMaxBlocked];
+
+int32_t List(PalSemaphore* semaphore) {
+    SchedLockGuard lock;
+    for (uint32_t i = 0; i < kMaxBlocked; ++i) {
+        if (gBlocked[i] == nullptr) {
+            gBlocked[i] = semaphore;
+            return static_cast<int32_t>(i);
+        }
+    }
+    return -1;
+}
+
+void Unlist(int32_t slot) {
+    if (slot < 0) return;
+    SchedLockGuard lock;
+    gBlocked[slot] = nullptr;
+}
+
+bool Stopping() { return gStopping.load(std::memory_order_seq_cst); }
+
+}  // namespace
+
+CallerInside::CallerInside() : entered_(true) {
+    gCallersInside.fetch_add(1, std::memory_order_seq_cst);
+    if (gStopping.load(std::memory_order_seq_cst)) {
+        gCallersInside.fetch_sub(1, std::memory_order_seq_cst);
+        entered_ = false;
+    }
+}
+
+CallerInside::~CallerInside() {
+    if (entered_) gCallersInside.fetch_sub(1, std::memory_order_seq_cst);
+}
+
+BlockResult BlockOn(PalSemaphore* semaphore, const timespec* deadline) {
+    const int32_t slot = List(semaphore);
+    const uint32_t r = PalSemaphoreWaitUntilUnless(semaphore, deadline, &Stopping);
+    Unlist(slot);
+    switch (r) {
+        case 0: return BlockResult::kTaken;
+        case 1: return BlockResult::kTimedOut;
+        case 3: return BlockResult::kStopped;
+        default: return BlockResult::kFailed;
+    }
+}
+
+void WakeBlockedWaiters() {
+    SchedLockGuard lock;
+    for (PalSemaphore* semaphore : gBlocked) {
+        if (semaphore != nullptr) PalSemaphoreWakeAll(semaphore);
+    }
+}
+
+bool WaitForCallersToLeave(uint32_t graceMs) {
+    for (uint32_t ms = 0; ms < graceMs; ++ms) {
+        if (gCallersInside.load(std::memory_order_seq_cst) <= 0) return true;
+        PalSleepMilliseconds(1);
+    }
+    return gCallersInside.load(std::memory_order_seq_cst) <= 0;
+}
+
+}  // namespace quelta

@@ -1,0 +1,101 @@
+// Global-clock nodes in the wait list: their place follows the global clock,
+// a deadline from before the monotonic clock's zero is simply past, and
+// neither an insert nor a tick pass converts times node by node (that work
+// would sit under the lock the timer thread needs).
+#include <gtest/gtest.h>
+
+#include <time.h>
+
+#include <atomic>
+#include <vector>
+
+#include "SchedulerHarness.h"
+#include "engine/ClockTimeOps.h"
+#include "engine/LibraryFrame.h"
+#include "engine/SchedulerState.h"
+#include "engine/SystemClock.h"
+#include "engine/WaitList.h"
+#include "engine/tKPusTimingEngine.h"
+
+using namespace quelta;
+using testsupport::SchedulerHarness;
+
+namespace {
+
+constexpr uint64_t kMs = 1000000;
+constexpr uint64_t kSecond = 1000 * kMs;
+
+std::atomic<int> gClockReads{0};
+int CountingGetTime(clockid_t id, timespec* ts) {
+    gClockReads.fetch_add(1);
+    return clock_gettime(id, ts);
+}
+
+class SchedulerGlobalNodes : public ::testing::Test {
+protected:
+    void TearDown() override {
+        ResetSystemClockHooks();
+        gConvertStandInEnabled.store(false);
+    }
+    uint32_t QueueGlobal(uint64_t deadline) {
+        WaitNode* node = h.Take();
+        EXPECT_NE(node, nullptr);
+        node->isGlobal.store(1);
+        node->autoRelease.store(1);
+        const ClockTime d = FromU64(deadline);
+        return InsertWaitNode(node, &d, nullptr, nullptr);
+    }
+    uint32_t Queued() {
+        uint32_t n = 0;
+        for (WaitNode* w = gWaitList.load(); w != nullptr; w = w->next.load()) ++n;
+        return n;
+    }
+    SchedulerHarness h;
+};
+
+// The harness's global clock is its monotonic clock plus the epoch offset.
+// With an offset of 100 s, a global deadline of 50 s lies 50 s before the
+// monotonic zero: due at the first pass, like any past deadline, and not
+// taken for a time far in the future.
+TEST_F(SchedulerGlobalNodes, ADeadlineBeforeTheMonotonicZeroIsPast) {
+    gEngine.load()->SetEpochOffset(100);
+    ASSERT_EQ(QueueGlobal(50 * kSecond), 0u);
+    ASSERT_EQ(QueueGlobal(200 * kSecond), 0u);  // 100 s monotonic: later
+    EXPECT_EQ(h.timer->LastArmed(), 0u) << "a past deadline arms the timer at once";
+    h.Pass();
+    EXPECT_EQ(Queued(), 1u) << "the past deadline was not fired";
+    EXPECT_EQ(gNextDeadline.Load(), h.Now() + kMs) << "the later node is folded, the tick comes first";
+}
+
+// 127 global-clock nodes are queued with the kernel's conversion replaced by
+// the user-space one, which reads the clocks. One more insert, and one pass,
+// must not read them once per queued node.
+TEST_F(SchedulerGlobalNodes, InsertAndPassDoNotConvertNodeByNode) {
+    gConvertStandInEnabled.store(true);
+    iKPusTimingEngine* engine = gEngine.load();
+    const uint64_t base = ToU64(engine->MonotonicToGlobal(FromU64(h.Now()))) + 30 * kSecond;
+    for (uint32_t i = 0; i < kWaitNodeCount - 1; ++i) {
+        ASSERT_EQ(QueueGlobal(base + (i + 1) * kMs), 0u);
+    }
+    ASSERT_EQ(Queued(), kWaitNodeCount - 1);
+    gSystemClock.getTime = &CountingGetTime;
+
+    gClockReads.store(0);
+    ASSERT_EQ(QueueGlobal(base + kSecond), 0u);  // walks past every node
+    const int insertReads = gClockReads.load();
+    gClockReads.store(0);
+    h.Pass();
+    const int passReads = gClockReads.load();
+    printf("clock reads: %d for the insert, %d for the pass, %u nodes queued\n", insertReads,
+           passReads, kWaitNodeCount);
+    EXPECT_LE(insertReads, 9) << "an insert converts every node it passes";
+    EXPECT_LE(passReads, 27) << "a pass converts node by node";
+
+    // The new node went behind all the others, by its global deadline.
+    ASSERT_EQ(Queued(), kWaitNodeCount) << "nodes 30 s ahead were fired";
+    WaitNode* last = gWaitList.load();
+    while (last->next.load() != nullptr) last = last->next.load();
+    EXPECT_EQ(last->deadline.load(), base + kSecond);
+}
+
+}  // namespace
