@@ -6,7 +6,8 @@
 // deadline; every call returns within a generous bound (a watchdog aborts with
 // the stuck operation named rather than hanging); afterwards exactly 128 nodes
 // can be taken and the 129th is refused with 3; read-outs stay in time order
-// per CPU and carry only CPU indices that exist.
+// per CPU and carry only CPU indices that exist; every post a thread made is
+// either taken by an event wait that returned 0 or still pending at the end.
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -49,6 +50,14 @@ std::atomic<uint64_t> gOrderViolations{0};
 std::atomic<uint64_t> gBadCpu{0};
 std::atomic<uint64_t> gCount[kOps];
 std::atomic<int> gCallbacksPending{0};
+
+// Post accounting for the shared semaphores. A thread posts only while no
+// post of its own is outstanding on that semaphore, so the semaphore never
+// drops one by its own rule (at most waiters + 1 pending) and every post
+// must be accounted for.
+constexpr int kShared = 8;
+std::atomic<int> gOutstanding[kShared];
+std::atomic<uint64_t> gPosts[kShared], gTakes[kShared];
 
 struct Ticket {
     uint64_t deadline;
@@ -108,16 +117,25 @@ public:
                     break;
                 }
                 case 3: {
-                    PalSemaphore* s = shared_[rng() % shared_.size()];
+                    const int k = static_cast<int>(rng() % kShared);
                     const uint32_t timeout = static_cast<uint32_t>(rng() % 4000);
                     const uint64_t start = MonoNowNs();
-                    if (api_.EventWait(s, timeout) == 1 && MonoNowNs() < start + timeout * kUs)
-                        gEarly.fetch_add(1);
+                    const uint32_t r = api_.EventWait(shared_[k], timeout);
+                    if (r == 0) {
+                        gTakes[k].fetch_add(1);
+                        gOutstanding[k].store(0);
+                    }
+                    if (r == 1 && MonoNowNs() < start + timeout * kUs) gEarly.fetch_add(1);
                     break;
                 }
-                case 4:
-                    quelta::PalSemaphorePost(shared_[rng() % shared_.size()]);
+                case 4: {
+                    const int k = static_cast<int>(rng() % kShared);
+                    int none = 0;
+                    if (!gOutstanding[k].compare_exchange_strong(none, 1)) break;
+                    gPosts[k].fetch_add(1);
+                    quelta::PalSemaphorePost(shared_[k]);
                     break;
+                }
                 case 5: {
                     ClockTime g;
                     uint32_t generation = 0;
@@ -195,7 +213,7 @@ TEST(Stress, EveryWaitAtOnceFromManyThreads) {
     lib.log()->SetEnabled(1);
     lib.api().SetCallback(TimeCallback, nullptr);
     Stress stress(lib);
-    for (int i = 0; i < 8; ++i) stress.shared_.push_back(testsupport::NewRuntimeSemaphore());
+    for (int i = 0; i < kShared; ++i) stress.shared_.push_back(testsupport::NewRuntimeSemaphore());
 
     std::atomic<bool> stop{false};
     std::vector<ThreadState> states(kThreads);
@@ -218,8 +236,6 @@ TEST(Stress, EveryWaitAtOnceFromManyThreads) {
         }
     }
     stop = true;
-    for (int round = 0; round < 100; ++round)
-        for (auto* s : stress.shared_) quelta::PalSemaphorePost(s);
     for (auto& t : threads) t.join();
     for (int i = 0; i < 400 && gCallbacksPending.load() > 0; ++i) usleep(5000);
     lib.api().SetCallback(nullptr, nullptr);
@@ -235,6 +251,13 @@ TEST(Stress, EveryWaitAtOnceFromManyThreads) {
     EXPECT_EQ(gBadCpu.load(), 0u);
     EXPECT_EQ(gOrderViolations.load(), 0u);
     EXPECT_EQ(gCallbacksPending.load(), 0);
+    for (int k = 0; k < kShared; ++k) {
+        uint64_t pending = 0;
+        while (quelta::PalSemaphoreWait(stress.shared_[k], 0) == 0) ++pending;
+        EXPECT_EQ(gPosts[k].load(), gTakes[k].load() + pending)
+            << "semaphore " << k << ": posts lost or invented (" << gTakes[k].load() << " taken, " << pending
+            << " pending)";
+    }
 
     // The pool is whole: exactly 128 nodes can be taken, the 129th is refused.
     PalSemaphore* s = testsupport::NewRuntimeSemaphore();
