@@ -88,8 +88,11 @@ TEST_F(SchedulerGlobalNodes, InsertAndPassDoNotConvertNodeByNode) {
     const int passReads = gClockReads.load();
     printf("clock reads: %d for the insert, %d for the pass, %u nodes queued\n", insertReads,
            passReads, kWaitNodeCount);
-    EXPECT_LE(insertReads, 9) << "an insert converts every node it passes";
-    EXPECT_LE(passReads, 27) << "a pass converts node by node";
+    // One measured offset costs a reading and at most three brackets of
+    // three readings (more when a bracket is wide, as under instrumentation);
+    // node by node it was hundreds.
+    EXPECT_LE(insertReads, 16) << "an insert converts every node it passes";
+    EXPECT_LE(passReads, 40) << "a pass converts node by node";
 
     // The new node went behind all the others, by its global deadline.
     ASSERT_EQ(Queued(), kWaitNodeCount) << "nodes 30 s ahead were fired";
