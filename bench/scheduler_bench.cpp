@@ -1,11 +1,17 @@
 // The tick scheduler's costs: one tick service pass with 0, 16 and 128 queued
-// nodes (a fake timer records the arming, nothing sleeps), and the lateness
-// of a wait whose deadline falls between ticks on the live timer thread.
+// nodes (a fake timer records the arming, nothing sleeps); how long an insert
+// holds the scheduler lock with 127 global-clock nodes queued; the lateness
+// of a wait whose deadline falls between ticks on the live timer thread; and
+// callback lateness with and without a low-priority thread inserting nodes
+// in a loop.
 #include <benchmark/benchmark.h>
 #include <sched.h>
+#include <unistd.h>
 #include <time.h>
 
 #include <algorithm>
+#include <atomic>
+#include <thread>
 #include <random>
 #include <vector>
 
@@ -17,6 +23,7 @@
 #include "engine/tKPusTimingEngine.h"
 #include "nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.h"
 #include "quelta/quelta.h"
+#include "tLinux/PalSemaphoreOps.h"
 
 using namespace quelta;
 
@@ -70,6 +77,152 @@ void BM_TickServicePass(benchmark::State& state) {
     SetLoadTimeSchedulerState();
 }
 BENCHMARK(BM_TickServicePass)->Arg(0)->Arg(16)->Arg(128)->Unit(benchmark::kNanosecond);
+
+double Percentile(std::vector<double> v, double p) {
+    if (v.empty()) return 0;
+    std::sort(v.begin(), v.end());
+    return v[std::min(v.size() - 1, static_cast<size_t>(p * static_cast<double>(v.size())))];
+}
+
+// Queues `count` global-clock nodes at random places an hour or so ahead, on
+// the library as it runs (callers' semaphore, so nothing blocks).
+std::vector<WaitNode*> QueueGlobalNodes(PalSemaphore* semaphore, int count, std::mt19937& rng) {
+    std::vector<WaitNode*> nodes;
+    ClockTime g;
+    gEngine.load()->ReadGlobal2(g);
+    for (int i = 0; i < count; ++i) {
+        const ClockTime d = FromU64(ToU64(g) + 3600ull * 1000000000ull + rng() % 1000000000ull);
+        WaitNode* node = nullptr;
+        if (quelta_iTSCEvent_Wait_Callback_C(semaphore, &d, nullptr, nullptr, 1, &node) == 0) nodes.push_back(node);
+    }
+    return nodes;
+}
+
+// One insert of a global-clock node among 127 queued ones, at a random place,
+// then its cancellation. The insert's whole duration bounds the time it holds
+// the scheduler lock (its offset is measured before the lock is taken).
+void BM_InsertAmong127GlobalNodes(benchmark::State& state) {
+    if (LibraryControl(0, 1, 0) != 1 || !TimerServing()) {
+        state.SkipWithError("the library could not start with a serving timer");
+        LibraryControl(0, 0, 0);
+        return;
+    }
+    std::mt19937 rng(11);
+    PalSemaphore* semaphore = nullptr;
+    PalSemaphoreCreate(&semaphore);
+    std::vector<WaitNode*> queued = QueueGlobalNodes(semaphore, kWaitNodeCount - 1, rng);
+    ClockTime g;
+    gEngine.load()->ReadGlobal2(g);
+    // At a real-time priority, so that what is measured is the insert, not
+    // the other processes that preempt a normal thread on a busy machine.
+    sched_param p{};
+    p.sched_priority = 50;
+    const bool fifo = sched_setscheduler(0, SCHED_FIFO, &p) == 0;
+    std::vector<double> us;
+    for (auto _ : state) {
+        WaitNode* node = TakeFreeNode();
+        node->fireCount.store(0);
+        node->prev.store(nullptr);
+        node->isGlobal.store(1);
+        node->autoRelease.store(0);
+        node->semaphore.store(semaphore);
+        const ClockTime d = FromU64(ToU64(g) + 3600ull * 1000000000ull + rng() % 1000000000ull);
+        const uint64_t t0 = MonoNs();
+        InsertWaitNode(node, &d, nullptr, nullptr);
+        us.push_back(static_cast<double>(MonoNs() - t0) / 1000.0);
+        ReleaseWaitNode(node);
+    }
+    p.sched_priority = 0;
+    sched_setscheduler(0, SCHED_OTHER, &p);
+    state.counters["fifo"] = fifo ? 1 : 0;
+    state.counters["queued"] = static_cast<double>(queued.size());
+    state.counters["p50_us"] = Percentile(us, 0.5);
+    state.counters["p99_us"] = Percentile(us, 0.99);
+    state.counters["max_us"] = Percentile(us, 1.0);
+    for (WaitNode* n : queued) ReleaseWaitNode(n);
+    LibraryControl(0, 0, 0);
+    PalSemaphoreDestroy(semaphore);
+}
+BENCHMARK(BM_InsertAmong127GlobalNodes)->Iterations(20000)->Unit(benchmark::kMicrosecond);
+
+std::atomic<uint64_t> gCallbackAt{0};
+void RecordCallback(void*) { gCallbackAt.store(MonoNs()); }
+
+// Lateness of monotonic callback times (1.3 ms + up to 0.5 ms ahead, set from
+// a SCHED_FIFO thread) in blocks of 100, alternately with a SCHED_OTHER thread
+// inserting and cancelling global-clock nodes among 126 queued ones, and
+// without it. The ratio of the two p99s is the cost a low-priority caller
+// imposes on the timer thread.
+void BM_CallbackLatenessWithLowPriorityInserter(benchmark::State& state) {
+    if (LibraryControl(0, 1, 0) != 1 || !TimerServing()) {
+        state.SkipWithError("the library could not start with a serving timer");
+        LibraryControl(0, 0, 0);
+        return;
+    }
+    std::mt19937 rng(13);
+    PalSemaphore* semaphore = nullptr;
+    PalSemaphoreCreate(&semaphore);
+    std::vector<WaitNode*> queued = QueueGlobalNodes(semaphore, kWaitNodeCount - 2, rng);
+    std::atomic<bool> inserting{false}, quit{false};
+    std::atomic<uint64_t> inserts{0};
+    std::thread inserter([&] {
+        std::mt19937 r(17);
+        ClockTime g;
+        gEngine.load()->ReadGlobal2(g);
+        while (!quit.load()) {
+            if (!inserting.load()) {
+                usleep(200);
+                continue;
+            }
+            const ClockTime d = FromU64(ToU64(g) + 3600ull * 1000000000ull + r() % 1000000000ull);
+            WaitNode* node = nullptr;
+            if (quelta_iTSCEvent_Wait_Callback_C(semaphore, &d, nullptr, nullptr, 1, &node) == 0) {
+                ReleaseWaitNode(node);
+                inserts.fetch_add(1);
+            }
+        }
+    });
+    sched_param p{};
+    p.sched_priority = 50;
+    const bool fifo = sched_setscheduler(0, SCHED_FIFO, &p) == 0;
+    quelta_iTSC_SetCallback(&RecordCallback, nullptr);
+    std::vector<double> quiet, busy;
+    int i = 0;
+    for (auto _ : state) {
+        const bool withInserter = (i++ / 100) % 2 == 1;
+        if (inserting.load() != withInserter) {
+            inserting.store(withInserter);
+            usleep(2000);
+        }
+        ClockTime now;
+        gEngine.load()->ReadMonotonic0(now);
+        const uint64_t due = ToU64(now) + 1300000 + rng() % 500000;
+        const ClockTime when = FromU64(due);
+        gCallbackAt.store(0);
+        quelta_iTSC_SetCallbackTime(&when, 0);
+        while (gCallbackAt.load() == 0) {
+            timespec ts{0, 50000};
+            nanosleep(&ts, nullptr);
+        }
+        (withInserter ? busy : quiet).push_back(static_cast<double>(gCallbackAt.load() - due) / 1000.0);
+    }
+    quit.store(true);
+    inserter.join();
+    quelta_iTSC_SetCallback(nullptr, nullptr);
+    p.sched_priority = 0;
+    sched_setscheduler(0, SCHED_OTHER, &p);
+    state.counters["quiet_p50_us"] = Percentile(quiet, 0.5);
+    state.counters["quiet_p99_us"] = Percentile(quiet, 0.99);
+    state.counters["busy_p50_us"] = Percentile(busy, 0.5);
+    state.counters["busy_p99_us"] = Percentile(busy, 0.99);
+    state.counters["p99_ratio"] = Percentile(busy, 0.99) / std::max(Percentile(quiet, 0.99), 1e-9);
+    state.counters["inserts"] = static_cast<double>(inserts.load());
+    state.counters["fifo"] = fifo ? 1 : 0;
+    for (WaitNode* n : queued) ReleaseWaitNode(n);
+    LibraryControl(0, 0, 0);
+    PalSemaphoreDestroy(semaphore);
+}
+BENCHMARK(BM_CallbackLatenessWithLowPriorityInserter)->Iterations(4000)->Unit(benchmark::kMicrosecond);
 
 // Arm-to-fire lateness of an own-semaphore wait with a deadline between ticks
 // (1.3 ms + up to 0.5 ms ahead), on the live library, from a SCHED_FIFO thread.

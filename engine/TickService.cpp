@@ -1,11 +1,18 @@
 // The tick service routine: one pass per timer expiry, on the timer thread.
 //
-// Every decision of a pass is taken against one monotonic reading `now` (and
-// its global equivalent). gNextDeadline is recomputed from scratch on every
+// Every decision of a pass is taken against one monotonic reading `now` and
+// its global equivalent. gNextDeadline is recomputed from scratch on every
 // pass; each change to it, here and in the callers' arming paths, is made
 // under gSchedLock so that the final arming of a pass can never overwrite an
-// earlier deadline that a caller armed meanwhile. Callbacks and semaphore
-// posts run without the lock.
+// earlier deadline that a caller armed meanwhile.
+//
+// The timer thread must not wait for callers, and a caller holding the lock
+// may have been preempted, so a pass takes the lock as seldom as it can: the
+// clock reading and both conversions are made before it, and one hold serves
+// the tick, both callback times, the expired nodes and the arming. Only a
+// pass that has something to call (a callback, a node to post, the tick
+// callback) leaves the lock for the calls and takes it once more to settle
+// the fired nodes and arm.
 #include "engine/TickService.h"
 
 #include "engine/ClockTimeOps.h"
@@ -23,7 +30,8 @@ namespace {
 
 constexpr std::memory_order kRelaxed = std::memory_order_relaxed;
 
-// The routine's own state, kept from pass to pass for the life of the process.
+// The routine's own state, kept from pass to pass for the life of the process
+// (timer thread only; atomics so that tests may reset it between runs).
 std::atomic<bool> sGenerationSeen{false};
 std::atomic<uint32_t> sLastGeneration{0};
 std::atomic<uint64_t> sTickSerial{0};
@@ -42,26 +50,15 @@ void CallCallback(const ClockTime* now) {
     fn(arg != nullptr ? arg : const_cast<ClockTime*>(now));
 }
 
-// Takes a due callback time: NeverTime replaces it before the callback runs,
-// so the callback may set its next time. False when a caller changed the time
-// between our read and the exchange (the new value is looked at again).
-bool TakeDueCallbackTime(AtomicClockTime& cell, uint64_t seen) {
-    return cell.CompareExchange(seen, kNeverTime64);
-}
-
-void FoldLocked(uint64_t t) {
-    SchedLockGuard lock;
+void FoldIntoNextDeadline(uint64_t t) {
     uint64_t d = gNextDeadline.Load();
     Fold(t, d);
     gNextDeadline.Store(d);
 }
 
-// Steps 1-3: start the recomputation and serve the tick when it is due.
-bool ServeTick(tKPusTimingEngine* engine, uint64_t& nowOut) {
-    SchedLockGuard lock;
-    gNextDeadline.Store(kNeverTime64);
-    uint64_t now = ReadNow(engine);
-    nowOut = now;
+// Serves the tick when it is due at `now`, with its jitter sample; afterwards
+// gNextDeadline is gNextTick. Lock held.
+bool ServeTickLocked(tKPusTimingEngine* engine, uint64_t now) {
     bool tickDue = false;
     uint64_t nextTick = gNextTick.Load();
     if (Due(nextTick, now)) {
@@ -82,33 +79,26 @@ bool ServeTick(tKPusTimingEngine* engine, uint64_t& nowOut) {
     return tickDue;
 }
 
-// A callback time that is due at `nowOnItsClock` is taken (NeverTime first,
-// so the callback may set its next one) and the callback runs with the pass's
-// monotonic `now`; otherwise the time, converted to the monotonic clock by
-// `global` when it is a global-clock time, is folded into gNextDeadline.
-void ServeCallbackTime(AtomicClockTime& cell, uint64_t nowOnItsClock, const ClockTime& now,
-                       iKPusTimingEngine* global) {
-    for (;;) {
-        const uint64_t t = cell.Load();
-        if (Due(t, nowOnItsClock)) {
-            if (!TakeDueCallbackTime(cell, t)) continue;  // changed meanwhile
-            CallCallback(&now);
-            return;
-        }
-        if (global == nullptr) {
-            FoldLocked(t);
-            return;
-        }
-        // The conversion is made on every pass; when it is earlier it is
-        // made once more for the value stored.
-        const uint64_t converted = ToU64(global->GlobalToMonotonic(FromU64(t)));
-        if (IsNever(t)) return;  // NeverTime cancels: never a converted instant
-        SchedLockGuard lock;
-        if (Earlier(converted, gNextDeadline.Load())) {
-            gNextDeadline.Store(ToU64(global->GlobalToMonotonic(FromU64(t))));
-        }
-        return;
-    }
+// What one pass found to do outside the lock.
+struct PassWork {
+    bool tickDue = false;
+    bool callMonotonic = false;  // the monotonic callback time was due
+    bool callGlobal = false;     // the global callback time was due
+    bool repeat = false;         // the global callback time changed under us
+    uint32_t fired = 0;
+    WaitNode* batch[kWaitNodeCount];
+    uint32_t release[kWaitNodeCount];
+};
+
+// Arms the timer for gNextDeadline. Lock held. False when the pass must be
+// repeated: no timer took the deadline, yet one serves.
+bool ArmNextLocked() {
+    const uint64_t next = gNextDeadline.Load();
+    if (IsNever(next)) return true;
+    if (ArmTimer(FromU64(next)) != 0) return true;
+    // No serving timer: nothing would run the next pass, and repeating would
+    // spin on this thread forever, so the pass ends here.
+    return !TimerServing();
 }
 
 }  // namespace
@@ -128,32 +118,69 @@ void TickServiceRoutine() {
         sGenerationSeen.store(true, kRelaxed);
     }
 
+    PassWork work;
     for (;;) {
-        uint64_t now64 = 0;
-        const bool tickDue = ServeTick(engine, now64);
-        const ClockTime now = FromU64(now64);
+        // Before the lock: the reading, its global equivalent, and the global
+        // callback time on the monotonic clock (NeverTime cancels: it is
+        // neither converted nor folded).
+        const uint64_t now = ReadNow(engine);
+        const ClockTime nowTime = FromU64(now);
+        const uint64_t nowGlobal = ToU64(slots->MonotonicToGlobal(nowTime));
+        const int64_t offset = GlobalOffsetOf(now, nowGlobal);
+        const uint64_t globalTime = gGlobalCallbackTime.Load();
+        const bool globalDue = Due(globalTime, nowGlobal);
+        uint64_t globalAsMonotonic = kNeverTime64;
+        if (!globalDue && !IsNever(globalTime)) globalAsMonotonic = ToU64(slots->GlobalToMonotonic(FromU64(globalTime)));
 
-        // The monotonic callback time, then the global one, which is compared
-        // on the global clock so that a step of the wall clock moves it along.
-        ServeCallbackTime(gMonotonicCallbackTime, now64, now, nullptr);
-        const uint64_t nowGlobal = ToU64(slots->MonotonicToGlobal(now));
-        ServeCallbackTime(gGlobalCallbackTime, nowGlobal, now, slots);
+        work.callMonotonic = work.callGlobal = work.repeat = false;
+        work.fired = 0;
+        {
+            SchedLockGuard lock;
+            gNextDeadline.Store(kNeverTime64);
+            work.tickDue = ServeTickLocked(engine, now);
 
-        // Abortable global-clock waits end when the clock's generation moved.
-        uint32_t generation = gGeneration.load(kRelaxed);
-        if (generation != sLastGeneration.load(kRelaxed)) {
-            sLastGeneration.store(generation, kRelaxed);
-            FireAbortableGlobalNodes();
+            // A due callback time is replaced by NeverTime before its
+            // callback runs, so the callback may set the next one.
+            const uint64_t monotonicTime = gMonotonicCallbackTime.Load();
+            if (Due(monotonicTime, now)) {
+                gMonotonicCallbackTime.Store(kNeverTime64);
+                work.callMonotonic = true;
+            } else {
+                FoldIntoNextDeadline(monotonicTime);
+            }
+            // The global callback time is compared on the global clock, so
+            // that a step of the wall clock moves it along.
+            if (gGlobalCallbackTime.Load() != globalTime) {
+                work.repeat = true;  // set meanwhile: look again with its conversion
+            } else if (globalDue) {
+                gGlobalCallbackTime.Store(kNeverTime64);
+                work.callGlobal = true;
+            } else {
+                FoldIntoNextDeadline(globalAsMonotonic);
+            }
+
+            // Abortable global-clock waits end when the clock's generation
+            // moved; then the expired heads, in list order.
+            const uint32_t generation = gGeneration.load(kRelaxed);
+            if (generation != sLastGeneration.load(kRelaxed)) {
+                sLastGeneration.store(generation, kRelaxed);
+                work.fired = DetachAbortableGlobalNodesLocked(work.batch, kWaitNodeCount);
+            }
+            work.fired += DetachDueHeadsLocked(now, offset, work.batch + work.fired, kWaitNodeCount - work.fired);
+
+            const bool tickCallback = work.tickDue && gTickCallback.load(kRelaxed) != nullptr;
+            if (!work.callMonotonic && !work.callGlobal && work.fired == 0 && !tickCallback && !work.repeat) {
+                if (ArmNextLocked()) return;
+                continue;
+            }
         }
 
-        // Expired heads, in list order; the first one not due is folded in.
-        // Global-clock heads are placed on the monotonic clock with this
-        // pass's own pair of readings, so the lock sees no conversion.
-        const int64_t offset = GlobalOffsetOf(now64, nowGlobal);
-        while (FireHeadIfDue(now64, offset)) {
-        }
-
-        if (tickDue) {
+        // The calls, without the lock: the callback for each due callback
+        // time (with the pass's monotonic now), the expired nodes, the tick.
+        if (work.callMonotonic) CallCallback(&nowTime);
+        if (work.callGlobal) CallCallback(&nowTime);
+        for (uint32_t i = 0; i < work.fired; ++i) work.release[i] = RunFiring(work.batch[i]);
+        if (work.tickDue) {
             QueltaTickCallbackFn tick = gTickCallback.load(std::memory_order_acquire);
             if (tick != nullptr) {
                 tick(sTickSerial.load(kRelaxed));
@@ -161,15 +188,10 @@ void TickServiceRoutine() {
             }
         }
 
-        {
-            SchedLockGuard lock;
-            uint64_t next = gNextDeadline.Load();
-            if (IsNever(next)) return;
-            if (ArmTimer(FromU64(next)) != 0) return;
-        }
-        // No serving timer: nothing would run the next pass. Repeating would
-        // spin on this thread forever, so the pass ends here.
-        if (!TimerServing()) return;
+        SchedLockGuard lock;
+        for (uint32_t i = 0; i < work.fired; ++i) SettleFiringLocked(work.batch[i], work.release[i]);
+        if (work.repeat) continue;
+        if (ArmNextLocked()) return;
     }
 }
 

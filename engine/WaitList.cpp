@@ -126,7 +126,33 @@ void InitSchedLock() {
     gSchedLockReady.store(true, std::memory_order_release);
 }
 
-SchedLockGuard::SchedLockGuard() { pthread_mutex_lock(&gSchedLock); }
+namespace {
+
+inline void CpuRelax() {
+#if defined(__x86_64__) || defined(__i386__)
+    __builtin_ia32_pause();
+#elif defined(__arm__) || defined(__aarch64__)
+    asm volatile("yield" ::: "memory");
+#endif
+}
+
+// Holds are a few hundred nanoseconds, so a thread that finds the lock taken
+// by a thread that is running does better to spin a moment than to sleep in
+// the kernel and be woken again (a wake-up costs tens of microseconds on a
+// busy machine, which the timer thread would add to every expiry it serves).
+// The spin is bounded: a holder that is not running (preempted) is then
+// boosted by priority inheritance as the spinner blocks.
+constexpr int kLockSpins = 32;
+
+}  // namespace
+
+SchedLockGuard::SchedLockGuard() {
+    for (int i = 0; i < kLockSpins; ++i) {
+        if (pthread_mutex_trylock(&gSchedLock) == 0) return;
+        CpuRelax();
+    }
+    pthread_mutex_lock(&gSchedLock);
+}
 SchedLockGuard::~SchedLockGuard() { pthread_mutex_unlock(&gSchedLock); }
 
 int64_t GlobalOffset() {
@@ -312,9 +338,7 @@ static void DetachForFiring(WaitNode* node) {
     node->state.store(static_cast<uint32_t>(NodeState::kFiring), kRelaxed);
 }
 
-// Under the lock, after the post (and callback): the node goes back to the
-// free list or stays with its holder, fired.
-static void SettleFired(WaitNode* node, uint32_t release) {
+void SettleFiringLocked(WaitNode* node, uint32_t release) {
     if (release != 0 || node->releasePending.load(kRelaxed) != 0) {
         PushFree(node);
     } else {
@@ -322,8 +346,7 @@ static void SettleFired(WaitNode* node, uint32_t release) {
     }
 }
 
-// Without the lock: post, callback, then settle where the node goes.
-static void FinishFiring(WaitNode* node) {
+uint32_t RunFiring(WaitNode* node) {
     PalSemaphore* semaphore = node->semaphore.load(kRelaxed);
     if (semaphore != nullptr) PalSemaphorePost(semaphore);
     uint32_t release = node->autoRelease.load(kRelaxed);
@@ -332,8 +355,7 @@ static void FinishFiring(WaitNode* node) {
         release = callback(node->callbackArg.load(kRelaxed));
         node->autoRelease.store(release, kRelaxed);
     }
-    SchedLockGuard lock;
-    SettleFired(node, release);
+    return release;
 }
 
 void FireWaitNode(WaitNode* node) {
@@ -342,25 +364,38 @@ void FireWaitNode(WaitNode* node) {
         if (node->state.load(kRelaxed) != static_cast<uint32_t>(NodeState::kQueued)) return;
         DetachForFiring(node);
     }
-    FinishFiring(node);
+    const uint32_t release = RunFiring(node);
+    SchedLockGuard lock;
+    SettleFiringLocked(node, release);
 }
 
-bool FireHeadIfDue(uint64_t now, int64_t offset) {
-    WaitNode* head;
-    {
-        SchedLockGuard lock;
-        head = gWaitList.load(kRelaxed);
-        if (head == nullptr) return false;
+uint32_t DetachDueHeadsLocked(uint64_t now, int64_t offset, WaitNode** batch, uint32_t room) {
+    uint32_t n = 0;
+    while (WaitNode* head = gWaitList.load(kRelaxed)) {
         const uint64_t effective = EffectiveDeadline(head, offset);
-        if (!Due(effective, now)) {
+        if (!Due(effective, now) || n == room) {
             // The head stays queued: fold its deadline into the next arming.
             if (Earlier(effective, gNextDeadline.Load())) gNextDeadline.Store(effective);
-            return false;
+            break;
         }
         DetachForFiring(head);
+        batch[n++] = head;
     }
-    FinishFiring(head);
-    return true;
+    return n;
+}
+
+uint32_t DetachAbortableGlobalNodesLocked(WaitNode** batch, uint32_t room) {
+    uint32_t n = 0;
+    WaitNode* node = gWaitList.load(kRelaxed);
+    while (node != nullptr && n < room) {
+        WaitNode* next = node->next.load(kRelaxed);
+        if (node->isGlobal.load(kRelaxed) != 0 && node->abortable.load(kRelaxed) != 0) {
+            DetachForFiring(node);
+            batch[n++] = node;
+        }
+        node = next;
+    }
+    return n;
 }
 
 uint32_t CloseEventSystemForStop() {
@@ -380,26 +415,8 @@ uint32_t CloseEventSystemForStop() {
         if (PalSemaphore* semaphore = fired[i]->semaphore.load(kRelaxed)) PalSemaphorePost(semaphore);
     }
     SchedLockGuard lock;
-    for (uint32_t i = 0; i < n; ++i) SettleFired(fired[i], fired[i]->autoRelease.load(kRelaxed));
+    for (uint32_t i = 0; i < n; ++i) SettleFiringLocked(fired[i], fired[i]->autoRelease.load(kRelaxed));
     return n;
-}
-
-void FireAbortableGlobalNodes() {
-    WaitNode* batch[kWaitNodeCount];
-    uint32_t n = 0;
-    {
-        SchedLockGuard lock;
-        WaitNode* node = gWaitList.load(kRelaxed);
-        while (node != nullptr && n < kWaitNodeCount) {
-            WaitNode* next = node->next.load(kRelaxed);
-            if (node->isGlobal.load(kRelaxed) != 0 && node->abortable.load(kRelaxed) != 0) {
-                DetachForFiring(node);
-                batch[n++] = node;
-            }
-            node = next;
-        }
-    }
-    for (uint32_t i = 0; i < n; ++i) FinishFiring(batch[i]);
 }
 
 bool AuditWaitNodes(uint32_t* freeCount, uint32_t* queuedCount, uint32_t* heldCount) {

@@ -130,13 +130,17 @@ void ReleaseWaitNode(WaitNode* node);
 uint32_t ReleaseWaitNodeReport(WaitNode* node);
 void FireWaitNode(WaitNode* node);  // tick service only
 
-// Tick service helpers. Fires the head when its effective deadline (global
-// ones at `offset`) is due at `now` and returns true; otherwise folds the
-// head's deadline into gNextDeadline and returns false (also false for an
-// empty list).
-bool FireHeadIfDue(uint64_t now, int64_t offset);
-// Fires every queued global-clock node that is abortable, in list order.
-void FireAbortableGlobalNodes();
+// Tick service helpers. With the lock held, the pass takes the nodes it is
+// to fire off the wait list (marked firing): every abortable global-clock
+// node, or the due heads (global ones at `offset`) in list order, folding the
+// first head that is not due into gNextDeadline. Each returns how many it put
+// into `batch` (room for `room`).
+uint32_t DetachAbortableGlobalNodesLocked(WaitNode** batch, uint32_t room);
+uint32_t DetachDueHeadsLocked(uint64_t now, int64_t offset, WaitNode** batch, uint32_t room);
+// Without the lock: posts the node's semaphore and runs its callback; returns
+// the release decision, to be settled with the lock held.
+uint32_t RunFiring(WaitNode* node);
+void SettleFiringLocked(WaitNode* node, uint32_t release);
 
 // The stop, once the timer thread is gone: in one hold of the lock the event
 // system is marked not ready and the free list emptied (no caller can take a
