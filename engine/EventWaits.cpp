@@ -105,13 +105,22 @@ WaitEnd WaitUntilGlobal(iKPusTimingEngine* engine, WaitNode* node, const ClockTi
             gGeneration.load(kRelaxed) != generation) {
             return WaitEnd::kAborted;
         }
-        switch (BlockUntil(own, GlobalToMonotonicAt(ToU64(deadline), GlobalOffset()))) {
+        const uint64_t bound = GlobalToMonotonicAt(ToU64(deadline), GlobalOffset());
+        node->selfWakeAt.store(bound == 0 ? 1 : bound, kRelaxed);
+        switch (BlockUntil(own, bound)) {
             case BlockResult::kStopped: return WaitEnd::kStopped;
             case BlockResult::kFailed: PalSleepMilliseconds(1); break;
             case BlockResult::kTaken:
             case BlockResult::kTimedOut: break;
         }
     }
+}
+
+// The waiter of a queued global-clock node is about to block until the
+// deadline's monotonic equivalent: the timer thread need not wake for it.
+void ExpectSelfWake(WaitNode* node, const ClockTime& deadline) {
+    const uint64_t bound = GlobalToMonotonicAt(ToU64(deadline), GlobalOffset());
+    node->selfWakeAt.store(bound == 0 ? 1 : bound, kRelaxed);
 }
 
 // A node as the waits take it: nothing fired, not queued yet.
@@ -123,6 +132,7 @@ void PrepareNode(WaitNode* node, uint32_t isGlobal, uint8_t abortable, uint32_t 
     node->abortable.store(abortable, kRelaxed);
     node->autoRelease.store(autoRelease, kRelaxed);
     node->semaphore.store(semaphore, kRelaxed);
+    node->selfWakeAt.store(0, kRelaxed);
 }
 
 // Global-clock wait without the tick service: one sleep of the remaining time
@@ -197,6 +207,7 @@ extern "C" QUELTA_EXPORT void quelta_iTSC_WaitUntilGlobalClocks64_C(const ClockT
         PrepareNode(node, 1, abortFlag != nullptr ? 1 : 0, 0, node->ownSemaphore.load(kRelaxed));
         const ClockTime copy = *target;
         WaitEnd end = WaitEnd::kDue;
+        ExpectSelfWake(node, copy);
         if (InsertWaitNode(node, &copy, nullptr, nullptr) == 0) end = WaitUntilGlobal(engine, node, copy, generation);
         if (abortFlag != nullptr && (end == WaitEnd::kStopped || generation != gGeneration.load(kRelaxed))) {
             *abortFlag = 1;
@@ -238,6 +249,7 @@ extern "C" QUELTA_EXPORT uint32_t quelta_iTSCEvent_Wait_Callback_C(PalSemaphore*
     uint32_t r;
     WaitEnd end = WaitEnd::kDue;
     if (isGlobal != 0) {
+        ExpectSelfWake(node, copy);
         r = InsertWaitNode(node, &copy, callback, callbackArg);
         if (r == 0) end = WaitUntilGlobal(engine, node, copy, 0);
     } else {

@@ -94,6 +94,27 @@ void LinkSorted(WaitNode* node, int64_t offset) {
     node->state.store(static_cast<uint32_t>(NodeState::kQueued), kRelaxed);
 }
 
+// True when the timer thread must wake for the node at `effective`: unless
+// its holder wakes by itself at about that time anyway.
+bool NeedsTimer(const WaitNode* node, uint64_t effective) {
+    const uint64_t self = node->selfWakeAt.load(kRelaxed);
+    return self == 0 || Earlier(effective + kSelfWakeSlackNs, self);
+}
+
+// The earliest deadline among the queued nodes that need the timer thread:
+// the head's, unless its holder wakes by itself; then the first node behind
+// it that needs the timer. Lock held.
+bool EarliestNeedingTimer(int64_t offset, uint64_t& out) {
+    for (WaitNode* n = gWaitList.load(kRelaxed); n != nullptr; n = n->next.load(kRelaxed)) {
+        const uint64_t effective = EffectiveDeadline(n, offset);
+        if (NeedsTimer(n, effective)) {
+            out = effective;
+            return true;
+        }
+    }
+    return false;
+}
+
 // On the timer thread, in a callback. Lock held (the timer cannot go away).
 bool OnTimerThread() {
     tKPusLinuxNanoSleepTimer* timer = gTimer.load(std::memory_order_acquire);
@@ -200,6 +221,8 @@ void InitWaitNodePool(WaitNode* pool, uint32_t count) {
         n.abortable.store(0, kRelaxed);
         n.state.store(static_cast<uint32_t>(NodeState::kFree), kRelaxed);
         n.releasePending.store(0, kRelaxed);
+        n.selfWakeAt.store(0, kRelaxed);
+        n.postOnFire.store(1, kRelaxed);
     }
     SchedLockGuard lock;
     gWaitNodePool.store(pool, kRelaxed);
@@ -266,7 +289,7 @@ uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
             queued = true;
             if (gWaitList.load(kRelaxed) == node) {
                 const uint64_t effective = EffectiveDeadline(node, offset);
-                if (Earlier(effective, gNextDeadline.Load())) {
+                if (NeedsTimer(node, effective) && Earlier(effective, gNextDeadline.Load())) {
                     gNextDeadline.Store(effective);
                     if (ArmTimer(FromU64(effective)) == 0) {
                         queued = false;
@@ -335,6 +358,7 @@ static void DetachForFiring(WaitNode* node) {
     node->fireCount.fetch_add(1, std::memory_order_release);
     UnlinkQueued(node);
     node->releasePending.store(0, kRelaxed);
+    node->postOnFire.store(1, kRelaxed);
     node->state.store(static_cast<uint32_t>(NodeState::kFiring), kRelaxed);
 }
 
@@ -348,7 +372,7 @@ void SettleFiringLocked(WaitNode* node, uint32_t release) {
 
 uint32_t RunFiring(WaitNode* node) {
     PalSemaphore* semaphore = node->semaphore.load(kRelaxed);
-    if (semaphore != nullptr) PalSemaphorePost(semaphore);
+    if (semaphore != nullptr && node->postOnFire.load(kRelaxed) != 0) PalSemaphorePost(semaphore);
     uint32_t release = node->autoRelease.load(kRelaxed);
     QueltaWaitCallbackFn callback = node->callback.load(kRelaxed);
     if (callback != nullptr) {
@@ -374,11 +398,18 @@ uint32_t DetachDueHeadsLocked(uint64_t now, int64_t offset, WaitNode** batch, ui
     while (WaitNode* head = gWaitList.load(kRelaxed)) {
         const uint64_t effective = EffectiveDeadline(head, offset);
         if (!Due(effective, now) || n == room) {
-            // The head stays queued: fold its deadline into the next arming.
-            if (Earlier(effective, gNextDeadline.Load())) gNextDeadline.Store(effective);
+            // The rest stays queued: fold the earliest deadline that needs
+            // the timer thread into the next arming.
+            uint64_t earliest;
+            if (EarliestNeedingTimer(offset, earliest) && Earlier(earliest, gNextDeadline.Load())) {
+                gNextDeadline.Store(earliest);
+            }
             break;
         }
         DetachForFiring(head);
+        // A holder whose own wake has come needs no post: it is waking.
+        const uint64_t self = head->selfWakeAt.load(kRelaxed);
+        if (self != 0 && Due(self, now)) head->postOnFire.store(0, kRelaxed);
         batch[n++] = head;
     }
     return n;

@@ -54,11 +54,24 @@ struct WaitNode {
     // holder while the tick service was firing it.
     std::atomic<uint32_t> state;
     std::atomic<uint32_t> releasePending;
+    // The monotonic time at which the node's holder, blocked in its own timed
+    // wait, wakes by itself (0: it does not). The holder writes it; the tick
+    // service reads it under the lock and neither arms the timer for such a
+    // node nor posts it once that time has come, as the holder's own wake
+    // ends the wait then: only a wall-clock step that brings the deadline
+    // well before it calls for the timer thread.
+    std::atomic<uint64_t> selfWakeAt;
+    std::atomic<uint8_t> postOnFire;  // set by the pass that detaches the node
 };
 
 namespace quelta {
 
 constexpr uint32_t kWaitNodeCount = 128;
+
+// A node whose holder wakes by itself needs the timer thread only when its
+// deadline comes this much before that wake (a step of the wall clock): the
+// conversion's own noise is far below it.
+constexpr uint64_t kSelfWakeSlackNs = 50000;
 
 enum class NodeState : uint32_t {
     kFree = 0,     // on the free list (or never taken)

@@ -16,6 +16,8 @@
 #include "engine/SystemClock.h"
 #include "engine/WaitList.h"
 #include "engine/tKPusTimingEngine.h"
+#include "tLinux/PalSemaphoreOps.h"
+#include "tLinux/PalThreads.h"
 
 using namespace quelta;
 using testsupport::SchedulerHarness;
@@ -99,6 +101,50 @@ TEST_F(SchedulerGlobalNodes, InsertAndPassDoNotConvertNodeByNode) {
     WaitNode* last = gWaitList.load();
     while (last->next.load() != nullptr) last = last->next.load();
     EXPECT_EQ(last->deadline.load(), base + kSecond);
+}
+
+// A global-clock wait whose waiter blocks until the deadline's monotonic
+// equivalent wakes by itself: the timer thread is not armed for it (it would
+// only compete with the waiter for a CPU), and a pass that finds it due after
+// that wake does not post it. A step of the wall clock that brings the
+// deadline well before the waiter's wake is the timer thread's business
+// again: the next pass fires it and posts its semaphore.
+TEST_F(SchedulerGlobalNodes, AWaiterThatWakesByItselfCostsTheTimerThreadNothing) {
+    ASSERT_EQ(PalInitialize(), 1u);
+    PalSemaphore* semaphore = nullptr;
+    ASSERT_EQ(PalSemaphoreCreate(&semaphore), 0);
+    const uint64_t tick = gNextDeadline.Load();
+    auto queue = [&](uint64_t deadline) {
+        WaitNode* node = h.Take();
+        node->isGlobal.store(1);
+        node->autoRelease.store(0);
+        node->semaphore.store(semaphore);
+        node->selfWakeAt.store(deadline);  // the harness's global clock is its monotonic clock
+        const ClockTime d = FromU64(deadline);
+        EXPECT_EQ(InsertWaitNode(node, &d, nullptr, nullptr), 0u);
+        return node;
+    };
+    WaitNode* node = queue(h.Now() + 400 * 1000);
+    EXPECT_EQ(h.timer->LastArmed(), kNeverTime64) << "armed for a waiter that wakes by itself";
+    h.SetNow(h.Now() + 100 * 1000);
+    h.Pass();
+    EXPECT_EQ(h.timer->LastArmed(), tick) << "a pass armed for it rather than for the tick";
+
+    h.SetNow(h.Now() + 400 * 1000);  // its wake has come
+    h.Pass();
+    EXPECT_NE(node->fireCount.load(), 0u);
+    EXPECT_EQ(PalSemaphoreWait(semaphore, 0), 1u) << "posted a waiter that was waking anyway";
+    ReleaseWaitNode(node);
+
+    // The wall clock steps 1 s forward: the deadline is now 0.6 s past.
+    node = queue(h.Now() + 400 * 1000);
+    gEngine.load()->SetEpochOffset(1);
+    h.SetNow(h.Now() + 1000);
+    h.Pass();
+    EXPECT_NE(node->fireCount.load(), 0u) << "a stepped deadline waited for the waiter's own wake";
+    EXPECT_EQ(PalSemaphoreWait(semaphore, 0), 0u) << "the waiter was not woken";
+    ReleaseWaitNode(node);
+    PalSemaphoreDestroy(semaphore);
 }
 
 }  // namespace
