@@ -90,6 +90,16 @@ PalSleepResult SleepUntil(TimerThreadState& state, uint32_t snapshot, const time
     return result;
 }
 
+// The stack the passes and their callbacks use is faulted in before the first
+// expiry, so that no expiry waits for the kernel to map a page.
+constexpr size_t kStackPrefaultBytes = 64 * 1024;
+
+__attribute__((noinline)) void PrefaultStack() {
+    char area[kStackPrefaultBytes];
+    for (size_t i = 0; i < kStackPrefaultBytes; i += 1024) area[i] = 0;
+    asm volatile("" : : "r"(area) : "memory");  // the stores must happen
+}
+
 void* TimerThreadStart(void* arg) {
     return tKPusLinuxNanoSleepTimer::isrthread(static_cast<TimerThreadState*>(arg));
 }
@@ -260,6 +270,7 @@ void* tKPusLinuxNanoSleepTimer::isrthread(TimerThreadState* state) {
         return nullptr;
     }
 
+    PrefaultStack();
     state->threadId.store(PalGetThreadId());
     SetStatus(*state, TimerThreadStatus::kServing);
 
