@@ -11,6 +11,7 @@
 
 #include <pthread.h>
 #include <sched.h>
+#include <unistd.h>
 #include <time.h>
 
 #include <algorithm>
@@ -21,6 +22,8 @@
 
 #include "nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.h"
 #include "tLinux/PalWake.h"
+#include "engine/LibraryFrame.h"
+#include "engine/TimerArming.h"
 
 namespace {
 
@@ -140,6 +143,63 @@ BENCHMARK(BM_ArmToCallbackLatency)
     ->Iterations(2000)
     ->UseRealTime()
     ->Unit(benchmark::kMicrosecond);
+
+// CPU time a thread has used, in ns.
+uint64_t ThreadCpuNs(pthread_t thread) {
+    clockid_t clock;
+    if (pthread_getcpuclockid(thread, &clock) != 0) return 0;
+    timespec ts{};
+    clock_gettime(clock, &ts);
+    return static_cast<uint64_t>(ts.tv_sec) * 1000000000ull + static_cast<uint64_t>(ts.tv_nsec);
+}
+
+// The library's timer thread at rest (the 1 ms tick and nothing else) against
+// a bare SCHED_FIFO thread that sleeps to the next millisecond with
+// clock_nanosleep, in the same window: CPU time per tick of each, and their
+// ratio. What the library adds to the bare loop is its pass (a clock reading,
+// its global equivalent, one hold of the scheduler lock, the re-arming).
+void BM_IdleTickCostAgainstABareLoop(benchmark::State& state) {
+    if (quelta::LibraryControl(0, 1, 0) != 1 || !quelta::TimerServing()) {
+        state.SkipWithError("the library could not start with a serving timer");
+        quelta::LibraryControl(0, 0, 0);
+        return;
+    }
+    const pthread_t timerThread = quelta::gTimer.load()->thread;
+    std::atomic<bool> quit{false};
+    std::atomic<uint64_t> bareTicks{0};
+    std::thread bare([&] {
+        sched_param p{};
+        p.sched_priority = sched_get_priority_max(SCHED_FIFO) - 1;
+        pthread_setschedparam(pthread_self(), SCHED_FIFO, &p);
+        uint64_t next = MonoNs();
+        while (!quit.load(std::memory_order_relaxed)) {
+            next += kTickNs;
+            const timespec ts{static_cast<time_t>(next / 1000000000ull), static_cast<long>(next % 1000000000ull)};
+            clock_nanosleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &ts, nullptr);
+            bareTicks.fetch_add(1, std::memory_order_relaxed);
+        }
+    });
+    usleep(100000);
+    double libraryNs = 0, bareNs = 0;
+    for (auto _ : state) {
+        const uint64_t lib0 = ThreadCpuNs(timerThread), bare0 = ThreadCpuNs(bare.native_handle());
+        const uint64_t ticks0 = bareTicks.load();
+        const uint64_t t0 = MonoNs();
+        usleep(2000000);
+        const double ms = static_cast<double>(MonoNs() - t0) / 1e6;  // the library ticks once per ms
+        libraryNs = static_cast<double>(ThreadCpuNs(timerThread) - lib0) / ms;
+        bareNs = static_cast<double>(ThreadCpuNs(bare.native_handle()) - bare0) /
+                 static_cast<double>(std::max<uint64_t>(1, bareTicks.load() - ticks0));
+    }
+    quit.store(true);
+    bare.join();
+    quelta::LibraryControl(0, 0, 0);
+    state.counters["library_ns_per_tick"] = libraryNs;
+    state.counters["bare_ns_per_tick"] = bareNs;
+    state.counters["ratio"] = libraryNs / std::max(bareNs, 1.0);
+}
+
+BENCHMARK(BM_IdleTickCostAgainstABareLoop)->Iterations(3)->UseRealTime()->Unit(benchmark::kMillisecond);
 
 }  // namespace
 
