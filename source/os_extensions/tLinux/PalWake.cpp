@@ -90,9 +90,13 @@ PalSleepResult PalWakeableSleepUntil(PalWakeWord& word, uint32_t snapshot, const
     }
 }
 
-void PalWake(PalWakeWord& word) {
-    word.sequence.fetch_add(1, std::memory_order_release);
+void PalWakeNotify(PalWakeWord& word) {
     syscall(SYS_futex, Address(word), kWakeOp, INT32_MAX, nullptr, nullptr, 0);
+}
+
+void PalWake(PalWakeWord& word) {
+    PalWakeMove(word);
+    PalWakeNotify(word);
 }
 
 }  // namespace quelta

@@ -56,6 +56,11 @@ PalSleepResult PalWakeableSleepUntil(PalWakeWord& word, uint32_t snapshot, const
 
 // Moves the word on and wakes every thread sleeping on it.
 void PalWake(PalWakeWord& word);
+// The same in two halves, so that the move can be made inside a lock and the
+// system call after it: a sleeper that snapshots under that lock sees either
+// the work and the move, or neither (and then its sleep ends at the notify).
+inline void PalWakeMove(PalWakeWord& word) { word.sequence.fetch_add(1, std::memory_order_release); }
+void PalWakeNotify(PalWakeWord& word);
 
 // Seam: tests switch the stand-in off to exercise the plain SIGALRM fallback.
 extern std::atomic<bool> gPalWakeStandInEnabled;

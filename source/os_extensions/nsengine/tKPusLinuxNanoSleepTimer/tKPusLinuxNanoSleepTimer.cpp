@@ -115,7 +115,7 @@ int32_t WakeTimerThread(TimerThreadState& state) {
 }
 
 tKPusLinuxNanoSleepTimer::tKPusLinuxNanoSleepTimer() : alarmAction(), thread(0), threadAttr() {
-    state.expiryLock = PTHREAD_RWLOCK_INITIALIZER;
+    state.expiryLock = PTHREAD_MUTEX_INITIALIZER;
 }
 
 void* tKPusLinuxNanoSleepTimer::operator new(size_t bytes) noexcept { return PalMemAlloc(bytes); }
@@ -126,7 +126,12 @@ int32_t tKPusLinuxNanoSleepTimer::Initialize(QueltaExpiryCallbackFn callback) {
     state.expiryCallback.store(callback);
     state.stopRequested.store(0);
 
-    if (pthread_rwlock_init(&state.expiryLock, nullptr) != 0) return 1;
+    pthread_mutexattr_t attr;
+    pthread_mutexattr_init(&attr);
+    pthread_mutexattr_setprotocol(&attr, PTHREAD_PRIO_INHERIT);
+    const int lockResult = pthread_mutex_init(&state.expiryLock, &attr);
+    pthread_mutexattr_destroy(&attr);
+    if (lockResult != 0) return 1;
 
     if (gWakeSyscallNr.load() == 0) {
         FILE* file = std::fopen("/sys/kernel/zq_syscall_sched_wake_up", "r");
@@ -172,15 +177,22 @@ void tKPusLinuxNanoSleepTimer::SetExpiry(ClockTime when) {
     const uint64_t ns = (static_cast<uint64_t>(when.high) << 32) | when.low;
     const uint64_t seconds = ns / kNsPerSecond;
 
-    pthread_rwlock_wrlock(&state.expiryLock);
+    pthread_mutex_lock(&state.expiryLock);
     state.expiry.tv_sec = static_cast<int32_t>(static_cast<uint32_t>(seconds));
     state.expiry.tv_nsec = static_cast<int32_t>(ns - seconds * kNsPerSecond);
 
     // Wake the thread while still holding the lock: it cannot take the new
-    // value without also seeing the wake (its snapshot of the wake word is
-    // taken under the same lock).
+    // value without also seeing the wake. The stand-in's wake word moves
+    // here (the thread snapshots it under this lock) and its sleepers are
+    // notified once the lock is free; the kernel call and the signal act on
+    // the sleep itself, so they are made here.
+    bool notify = false;
     if (state.threadId.load() >= 0 && !OnTimerThread()) {
-        if (WakeTimerThread(state) == kNoSyscall) {
+        if (gWakeSyscallNr.load(std::memory_order_relaxed) < 1 &&
+            gPalWakeStandInEnabled.load(std::memory_order_relaxed)) {
+            PalWakeMove(state.wakeWord);
+            notify = true;
+        } else if (WakeTimerThread(state) == kNoSyscall) {
             if (gWakeWarningShown.exchange(1) == 0) {
                 std::printf(
                     "Warning: using sched_wake_up system call %d failed!\n"
@@ -191,7 +203,8 @@ void tKPusLinuxNanoSleepTimer::SetExpiry(ClockTime when) {
             pthread_kill(thread, SIGALRM);
         }
     }
-    pthread_rwlock_unlock(&state.expiryLock);
+    pthread_mutex_unlock(&state.expiryLock);
+    if (notify) PalWakeNotify(state.wakeWord);
 }
 
 void tKPusLinuxNanoSleepTimer::ExpireNow() { SetExpiry(ClockTime{0, 0}); }
@@ -239,7 +252,7 @@ tKPusLinuxNanoSleepTimer::~tKPusLinuxNanoSleepTimer() {
         pthread_mutex_unlock(&gAlarmMutex);
         actionInstalled_ = false;
     }
-    pthread_rwlock_destroy(&state.expiryLock);
+    pthread_mutex_destroy(&state.expiryLock);
 }
 
 // Does nothing: SIGALRM only has to end a plain clock_nanosleep with EINTR.
@@ -279,11 +292,11 @@ void* tKPusLinuxNanoSleepTimer::isrthread(TimerThreadState* state) {
 
         // Take the deadline exactly once: whoever sets the next one moves
         // the wake word after this snapshot, or set it before this take.
-        pthread_rwlock_rdlock(&state->expiryLock);
+        pthread_mutex_lock(&state->expiryLock);
         const uint32_t snapshot = PalWakeSnapshot(state->wakeWord);
         const TimerTimespec taken = state->expiry;
         state->expiry = TimerTimespec{kParkedSeconds, 0};
-        pthread_rwlock_unlock(&state->expiryLock);
+        pthread_mutex_unlock(&state->expiryLock);
         if (state->stopRequested.load() != 0) break;
 
         timespec deadline{};

@@ -1,9 +1,14 @@
 // tKPusLinuxNanoSleepTimer: the one-shot absolute-deadline timer on a
 // dedicated SCHED_FIFO thread named "QUELTAisr".
 //
-// Protocol: SetExpiry writes `expiry` under expiryLock held exclusively and
-// wakes the thread; the thread takes `expiry` (and resets it to the far value)
-// under the same lock in shared mode, so each deadline is taken exactly once.
+// Protocol: SetExpiry writes `expiry` under expiryLock and wakes the thread;
+// the thread takes `expiry` (and resets it to the far value) under the same
+// lock, so each deadline is taken exactly once. The lock is a
+// priority-inheriting mutex, not a reader-writer lock: a setter of low
+// priority preempted while it holds the lock is then boosted for as long as
+// the top-priority timer thread waits for it, instead of holding it up
+// without bound. A setter holds it for a few stores (the stand-in's system
+// call is made after it lets go).
 // The thread sleeps on absolute CLOCK_MONOTONIC deadlines: with
 // clock_nanosleep when the kernel's wake-up call is configured (which ends
 // such a sleep), otherwise on the timer's wake word (tLinux/PalWake.h), whose
@@ -53,13 +58,13 @@ enum class TimerSleepKind : int32_t {
 struct TimerThreadState {
     std::atomic<int32_t> threadId{-1};      // gettid of the timer thread; written once
     TimerTimespec expiry{kParkedSeconds, 0}; // guarded by expiryLock
-    pthread_rwlock_t expiryLock;
+    pthread_mutex_t expiryLock;              // priority-inheriting once Initialize ran
     std::atomic<uint8_t> stopRequested{0};  // written once, by the destructor
     std::atomic<QueltaExpiryCallbackFn> expiryCallback{nullptr};
-    // Beyond the record proper. The wake word moves, under expiryLock held
-    // exclusively, whenever SetExpiry hands the thread a new expiry through
-    // the stand-in (and once more on stop); the thread snapshots it under the
-    // lock in shared mode with each take.
+    // Beyond the record proper. The wake word moves, under expiryLock,
+    // whenever SetExpiry hands the thread a new expiry through the stand-in
+    // (and once more on stop); the thread snapshots it under the lock with
+    // each take.
     PalWakeWord wakeWord;
     std::atomic<int32_t> sleepKind{static_cast<int32_t>(TimerSleepKind::kAwake)};  // timer thread writes
     std::atomic<int32_t> status{static_cast<int32_t>(TimerThreadStatus::kStarting)};
