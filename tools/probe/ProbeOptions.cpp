@@ -38,7 +38,7 @@ bool ParseDurationText(const std::string& text, int64_t& seconds) {
     if (unit != 0) digits.pop_back();
     else unit = 1;
     int64_t v = 0;
-    if (!ParseWhole(digits, v) || v > kMaxDurationS) return false;
+    if (!ParseWhole(digits, v) || v > kMaxDurationS || v * unit > kMaxDurationS) return false;
     seconds = v * unit;
     return true;
 }
