@@ -302,15 +302,14 @@ void Worker::Run() {
     }
     out.timerRunning = TimerServes();
     if (!out.timerRunning) {
-        const std::string why =
-            "the library has no timer: its timer thread needs real-time privilege (root, CAP_SYS_NICE or "
-            "ulimit -r 99), and without it the library answers these waits with \"no timer\" at once";
         for (uint32_t id : {kTick, kEventOwnSem, kEventTimeout, kGlobalWait, kCallbackTime}) {
             stats[id].measured = false;
-            stats[id].notMeasured = "needs the library's timer (real-time privilege)";
+            stats[id].notMeasured = "needs real-time privilege";
         }
         out.notes.push_back("tick, event-own-sem, event-timeout, global-wait and callback-time were not "
-                            "measured: " + why);
+                            "measured: without real-time privilege (root, CAP_SYS_NICE or ulimit -r 99) the "
+                            "library's timer thread cannot run, and the library answers these waits with "
+                            "\"no timer\" at once, as documented");
     }
 
     // The log keeps the whole survey if it can: every CPU's ring large enough.
@@ -596,10 +595,9 @@ bool Survey::Start() {
     const SurveyConfig& config = worker_->config;
     int timerPolicy = 0, timerPriority = 0;
     if (!TimerThreadPolicy(timerPolicy, timerPriority)) {
-        result.notes.push_back("the library's timer thread QUELTAisr is not running (it needs SCHED_FIFO): "
-                               "nothing serves the tick, the callbacks or the event and global-clock waits");
+        timerThreadNote_ = "the library's timer thread QUELTAisr is not running (it needs SCHED_FIFO)";
     } else if (timerPolicy != SCHED_FIFO) {
-        result.notes.push_back("the library's timer thread QUELTAisr does not run under SCHED_FIFO");
+        timerThreadNote_ = "the library's timer thread QUELTAisr does not run under SCHED_FIFO";
     }
 
     cpu_set_t set;
@@ -700,6 +698,8 @@ SurveyResult Survey::Finish(SampleSink* sink) {
     Poll(sink);
     ProcessTicks(sink, true);
     SurveyResult& out = result_;
+    // Without a timer the not-measured note says it all.
+    if (out.timerRunning && !timerThreadNote_.empty()) out.notes.insert(out.notes.begin(), timerThreadNote_);
     out.series = std::move(worker_->stats);
     out.series[kTick].histogram = std::move(tick_.histogram);
     out.series[kTick].overMs = tick_.overMs;

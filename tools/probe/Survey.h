@@ -140,6 +140,7 @@ private:
     std::vector<uint64_t> tickChunk_;
     SeriesStats tick_;
     double baselineMinUs_ = -1.0;
+    std::string timerThreadNote_;  // what /proc says of the library's timer thread
 };
 
 // The describe function for the trace exporter: names the probe's entries
