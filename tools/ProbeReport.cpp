@@ -6,7 +6,7 @@
 #include <iterator>
 #include <limits>
 
-#include "JsonWriter.h"
+#include <nlohmann/json.hpp>
 
 namespace qtools {
 
@@ -43,7 +43,7 @@ void FinishVerdicts(ProbeReport& report) {
         s.ratio = isBase ? (s.summary.count > 0 && s.summary.p99 > 0 ? 1.0
                                                                        : std::numeric_limits<double>::quiet_NaN())
                          : RatioP99(s.summary, b);
-        s.verdict = VerdictFor(s.summary, b, isBase, s.failed);
+        s.verdict = s.measured ? VerdictFor(s.summary, b, isBase, s.failed) : "not measured: " + s.notMeasured;
     }
 }
 
@@ -56,68 +56,63 @@ std::size_t LibraryEarlyCount(const ProbeReport& report) {
 }
 
 std::string ReportToJson(const ProbeReport& r) {
-    JsonWriter w(2);
-    w.BeginObject();
-    w.Key("schema").String(kProbeSchema);
-    w.Key("machine").BeginObject();
-    w.Key("cpus").Unsigned(r.machine.cpus);
-    w.Key("kernel").String(r.machine.kernel);
-    w.Key("kernel_version").String(r.machine.kernelVersion);
-    w.Key("arch").String(r.machine.arch);
-    w.Key("realtime").Bool(r.machine.realtime);
-    w.Key("priority").Integer(r.machine.priority);
-    w.Key("memory_locked").Bool(r.machine.memoryLocked);
-    w.EndObject();
-    w.Key("library").String(r.library);
-    w.Key("tick_service").Bool(r.tickService);
-    w.Key("duration_s").Number(r.durationS, 3);
-    w.Key("series").BeginArray();
+    using json = nlohmann::ordered_json;
+    // Three decimals (ns) are all a microsecond value carries; NaN is null.
+    auto number = [](double v, double scale = 1000.0) -> json {
+        if (!std::isfinite(v)) return nullptr;
+        return std::round(v * scale) / scale;
+    };
+    json doc = json::object();
+    doc["schema"] = kProbeSchema;
+    doc["machine"] = {{"cpus", r.machine.cpus},
+                      {"kernel", r.machine.kernel},
+                      {"kernel_version", r.machine.kernelVersion},
+                      {"arch", r.machine.arch},
+                      {"realtime", r.machine.realtime},
+                      {"priority", r.machine.priority},
+                      {"memory_locked", r.machine.memoryLocked}};
+    doc["library"] = r.library;
+    doc["tick_service"] = r.tickService;
+    doc["timer_running"] = r.timerRunning;
+    doc["duration_s"] = number(r.durationS);
+    doc["interrupted"] = r.interrupted;
+    doc["survey_cpus"] = r.surveyCpus.empty() ? json(nullptr) : json(r.surveyCpus);
+    json series = json::array();
     for (const SeriesResult& s : r.series) {
         const Summary& m = s.summary;
-        w.BeginObject();
-        w.Key("name").String(s.name);
-        w.Key("description").String(s.description);
-        w.Key("unit").String("us");
-        w.Key("count").Unsigned(m.count);
-        w.Key("min").Number(m.min, 3);
-        w.Key("p50").Number(m.p50, 3);
-        w.Key("p90").Number(m.p90, 3);
-        w.Key("p99").Number(m.p99, 3);
-        w.Key("p999").Number(m.p999, 3);
-        w.Key("max").Number(m.max, 3);
-        w.Key("ratio_p99_to_baseline").Number(s.ratio, 3);
-        w.Key("verdict").String(s.verdict);
-        w.Key("early").Unsigned(m.early);
-        w.Key("failed").Unsigned(s.failed);
-        w.Key("over_1ms").Unsigned(s.overMs);
-        if (s.cpuHeld >= 0) {
-            w.Key("over_1ms_cpu_held").Integer(s.cpuHeld);
-        } else {
-            w.Key("over_1ms_cpu_held").Null();
-        }
-        w.EndObject();
+        series.push_back({{"name", s.name},
+                          {"description", s.description},
+                          {"measured", s.measured},
+                          {"not_measured_reason", s.measured ? json(nullptr) : json(s.notMeasured)},
+                          {"unit", "us"},
+                          {"count", m.count},
+                          {"min", number(m.min)},
+                          {"mean", number(m.mean)},
+                          {"p50", number(m.p50)},
+                          {"p90", number(m.p90)},
+                          {"p99", number(m.p99)},
+                          {"p999", number(m.p999)},
+                          {"max", number(m.max)},
+                          {"ratio_p99_to_baseline", number(s.ratio)},
+                          {"verdict", s.verdict},
+                          {"early", m.early},
+                          {"failed", s.failed},
+                          {"over_1ms", s.overMs},
+                          {"over_1ms_cpu_held", s.cpuHeld >= 0 ? json(s.cpuHeld) : json(nullptr)}});
     }
-    w.EndArray();
-    w.Key("costs").BeginArray();
+    doc["series"] = std::move(series);
+    json costs = json::array();
     for (const CostResult& c : r.costs) {
-        w.BeginObject();
-        w.Key("name").String(c.name);
-        w.Key("label").String(c.label);
-        if (c.slot >= 0) {
-            w.Key("slot").Integer(c.slot);
-        } else {
-            w.Key("slot").Null();
-        }
-        w.Key("ns_per_call").Number(c.nsPerCall, 2);
-        if (c.baselineNs >= 0) w.Key("baseline_ns").Number(c.baselineNs, 2);
-        w.EndObject();
+        json cost = {{"name", c.name},
+                     {"label", c.label},
+                     {"slot", c.slot >= 0 ? json(c.slot) : json(nullptr)},
+                     {"ns_per_call", number(c.nsPerCall, 100.0)}};
+        if (c.baselineNs >= 0) cost["baseline_ns"] = number(c.baselineNs, 100.0);
+        costs.push_back(std::move(cost));
     }
-    w.EndArray();
-    w.Key("notes").BeginArray();
-    for (const std::string& n : r.notes) w.String(n);
-    w.EndArray();
-    w.EndObject();
-    return w.str() + "\n";
+    doc["costs"] = std::move(costs);
+    doc["notes"] = r.notes;
+    return doc.dump(2) + "\n";
 }
 
 std::string FormatSeriesTable(const ProbeReport& r) {

@@ -26,6 +26,8 @@ struct MachineInfo {
 struct SeriesResult {
     std::string name;
     std::string description;
+    bool measured = true;      // false: the survey could not run it (see notMeasured)
+    std::string notMeasured;   // why, for a person
     Summary summary;           // microseconds
     std::size_t failed = 0;    // calls that did not return as documented (no sample)
     std::size_t overMs = 0;    // samples more than 1 ms late
@@ -46,7 +48,10 @@ struct ProbeReport {
     MachineInfo machine;
     std::string library;
     bool tickService = true;   // the engine's UsesTickService
+    bool timerRunning = true;  // the library's timer serves (its waits did not answer "no timer")
     double durationS = 0.0;
+    bool interrupted = false;  // ended by a signal rather than by the duration
+    std::vector<int> surveyCpus;  // the survey thread's CPUs (empty: not restricted)
     std::vector<SeriesResult> series;  // the one named "baseline" is the reference
     std::vector<CostResult> costs;
     std::vector<std::string> notes;    // warnings worth a person's attention
@@ -57,6 +62,7 @@ void FinishVerdicts(ProbeReport& report);
 // Wait series that returned early, the baseline excluded.
 std::size_t LibraryEarlyCount(const ProbeReport& report);
 
+// The JSON document, indented by two spaces, ending in a newline.
 std::string ReportToJson(const ProbeReport& report);
 std::string FormatSeriesTable(const ProbeReport& report);
 std::string FormatCostTable(const ProbeReport& report);

@@ -17,32 +17,27 @@ std::string Format(const char* fmt, double a, double b = 0.0) {
 }
 }  // namespace
 
-Summary::Summary() : min(kNaN), p50(kNaN), p90(kNaN), p99(kNaN), p999(kNaN), max(kNaN) {}
+Summary::Summary() : min(kNaN), mean(kNaN), p50(kNaN), p90(kNaN), p99(kNaN), p999(kNaN), max(kNaN) {}
 
-double PercentileOfSorted(const std::vector<double>& sorted, double fraction) {
-    if (sorted.empty()) return kNaN;
-    const double n = static_cast<double>(sorted.size());
-    // Rank 1..n; the small epsilon keeps 0.9 * 100 from becoming 90.000001.
-    double rank = std::ceil(fraction * n - 1e-9);
-    if (rank < 1.0) rank = 1.0;
-    if (rank > n) rank = n;
-    return sorted[static_cast<std::size_t>(rank) - 1];
+Summary Summarize(const LatencyHistogram& h) {
+    Summary s;
+    s.count = static_cast<std::size_t>(h.count());
+    s.early = static_cast<std::size_t>(h.early());
+    if (s.count == 0) return s;
+    s.min = h.min();
+    s.max = h.max();
+    s.mean = h.mean();
+    s.p50 = h.Percentile(0.50);
+    s.p90 = h.Percentile(0.90);
+    s.p99 = h.Percentile(0.99);
+    s.p999 = h.Percentile(0.999);
+    return s;
 }
 
-Summary Summarize(std::vector<double> values) {
-    Summary s;
-    s.count = values.size();
-    if (values.empty()) return s;
-    std::sort(values.begin(), values.end());
-    s.early = static_cast<std::size_t>(
-        std::lower_bound(values.begin(), values.end(), 0.0) - values.begin());
-    s.min = values.front();
-    s.max = values.back();
-    s.p50 = PercentileOfSorted(values, 0.50);
-    s.p90 = PercentileOfSorted(values, 0.90);
-    s.p99 = PercentileOfSorted(values, 0.99);
-    s.p999 = PercentileOfSorted(values, 0.999);
-    return s;
+Summary Summarize(const std::vector<double>& values) {
+    LatencyHistogram h;
+    for (double v : values) h.Add(v);
+    return Summarize(h);
 }
 
 double RatioP99(const Summary& series, const Summary& baseline) {

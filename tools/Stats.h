@@ -7,15 +7,19 @@
 #include <string>
 #include <vector>
 
+#include "LatencyHistogram.h"
+
 namespace qtools {
 
 // Percentiles use the nearest-rank rule: the p-th percentile of n sorted
-// values is the value at rank ceil(p/100 * n) (1-based), so it is always one
-// of the samples. Fields are NaN for an empty series.
+// values is the value at rank ceil(p/100 * n) (1-based), read from the
+// series' histogram (exact to 0.1 us below 10 ms). Fields are NaN for an
+// empty series.
 struct Summary {
     std::size_t count = 0;
     std::size_t early = 0;  // values below zero (a wait that returned early)
     double min;
+    double mean;
     double p50;
     double p90;
     double p99;
@@ -24,12 +28,9 @@ struct Summary {
     Summary();
 };
 
-// Nearest-rank percentile of values sorted ascending; fraction in [0, 1]
-// (0.99 for p99). NaN for an empty vector.
-double PercentileOfSorted(const std::vector<double>& sorted, double fraction);
-
-// Sorts a copy of the values and summarises them.
-Summary Summarize(std::vector<double> values);
+Summary Summarize(const LatencyHistogram& histogram);
+// The same for a handful of values (through a histogram).
+Summary Summarize(const std::vector<double>& values);
 
 // p99 of a series over p99 of the baseline; NaN when either is missing or
 // the baseline's p99 is not above zero.

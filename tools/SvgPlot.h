@@ -1,37 +1,44 @@
-// A latency histogram as a standalone SVG image: x is the lateness in
-// microseconds on a logarithmic axis (log-spaced buckets), y the number of
-// samples per bucket on a logarithmic axis; one curve per series, a legend,
-// axes with labels and decade ticks.
+// The survey's picture as a standalone SVG image: a tail plot. For every
+// series, the fraction of its wakes that came later than x, over the lateness
+// x; both axes logarithmic. A curve further left and lower is better; the
+// machine's own limit (the series named "baseline") is drawn last, on top,
+// black and thick, so every other curve reads against it. Each series has a
+// marker at its p99 on the 1 % line, and the legend gives count, p99 and the
+// ratio to the baseline's p99. Series that were not measured are named in the
+// legend, greyed, without a curve.
 //
-// Each curve is one <polyline> with class "curve curve-<name>" (the name with
-// every character outside [A-Za-z0-9_-] replaced by '_'); nothing else in the
-// image is a polyline or a path, so a reader can count the curves.
+// Each curve is one <polyline class="curve curve-<name>"> (the name with
+// every character outside [A-Za-z0-9_-] replaced by '_'); nothing else is a
+// polyline. Each p99 marker is one element with class "p99 p99-<name>".
 #ifndef QUELTA_TOOLS_SVGPLOT_H
 #define QUELTA_TOOLS_SVGPLOT_H
 
 #include <string>
 #include <vector>
 
+#include "LatencyHistogram.h"
+
 namespace qtools {
 
 struct PlotSeries {
     std::string name;
-    std::vector<double> valuesUs;  // lateness samples in microseconds
+    const LatencyHistogram* histogram = nullptr;
+    bool measured = true;
+    std::string note;  // shown in the legend for a series not measured
 };
 
 struct PlotOptions {
     std::string title = "Wake-up lateness";
     std::string subtitle;
-    int width = 960;
-    int height = 600;
-    int bucketsPerDecade = 10;
+    int width = 980;
+    int height = 620;
+    int pointsPerDecade = 40;
 };
 
 // Class-name form of a series name.
 std::string CurveClass(const std::string& name);
 
-std::string RenderLatencyHistogram(const std::vector<PlotSeries>& series,
-                                   const PlotOptions& options = PlotOptions());
+std::string RenderTailPlot(const std::vector<PlotSeries>& series, const PlotOptions& options = PlotOptions());
 
 }  // namespace qtools
 

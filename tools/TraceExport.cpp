@@ -1,44 +1,41 @@
 #include "TraceExport.h"
 
+#include <cmath>
 #include <cstdio>
 #include <map>
 #include <set>
 #include <vector>
 
-#include "JsonWriter.h"
-
 namespace qtools {
 
 namespace {
 
+using json = nlohmann::ordered_json;
 constexpr int kPid = 1;
-constexpr uint32_t kNoData = 0xFFFFFFFFu;
 
 uint64_t TimeOf(const LogReadOut& r, uint32_t i) {
     return (static_cast<uint64_t>(r.timeHigh[i]) << 32) | r.timeLow[i];
 }
 
+// Microseconds with three decimals: the log's nanoseconds, no more.
 double MicrosSince(uint64_t t, uint64_t origin) {
-    return t >= origin ? static_cast<double>(t - origin) / 1000.0
-                       : -static_cast<double>(origin - t) / 1000.0;
+    const double ns = t >= origin ? static_cast<double>(t - origin) : -static_cast<double>(origin - t);
+    return std::round(ns) / 1000.0;
 }
 
-void Common(JsonWriter& w, const TraceEventInfo& info, const char* phase, uint32_t cpu, double ts) {
-    w.Key("name").String(info.name);
-    w.Key("cat").String(info.category);
-    w.Key("ph").String(phase);
-    w.Key("pid").Integer(kPid);
-    w.Key("tid").Unsigned(cpu);
-    w.Key("ts").Number(ts, 3);
+json Event(const TraceEventInfo& info, const char* phase, uint32_t cpu, double ts) {
+    return json{{"name", info.name}, {"cat", info.category}, {"ph", phase},
+                {"pid", kPid},       {"tid", cpu},           {"ts", ts}};
 }
 
 }  // namespace
 
-TraceEventInfo DescribeEventWord(uint32_t eventWord) {
+TraceEventInfo DescribeEventWord(const TraceEntry& e) {
     char buf[32];
-    std::snprintf(buf, sizeof buf, "event 0x%08x", static_cast<unsigned>(eventWord & ~0xFF00u));
+    std::snprintf(buf, sizeof buf, "event 0x%08x", static_cast<unsigned>(e.event & ~0xFF00u));
     TraceEventInfo info;
     info.name = buf;
+    if (e.data != kLogNoData) info.args["data"] = e.data;
     return info;
 }
 
@@ -56,39 +53,37 @@ std::string ExportChromeTrace(const LogReadOut& r, const TraceDescribeFn& descri
         cpus.insert(TraceCpuOf(r.events[i]));
     }
 
-    std::vector<std::string> events;
-    auto emit = [&](const JsonWriter& w) { events.push_back(w.str()); };
+    // One event per line: a large trace stays readable with line tools, and
+    // each event is serialised on its own rather than held as one tree.
+    std::string out = "{\"traceEvents\":[\n";
+    bool first = true;
+    auto emit = [&](const json& e) {
+        if (!first) out += ",\n";
+        first = false;
+        out += e.dump();
+    };
 
-    {
-        JsonWriter w(0);
-        w.BeginObject().Key("name").String("process_name").Key("ph").String("M");
-        w.Key("pid").Integer(kPid).Key("tid").Integer(0);
-        w.Key("args").BeginObject().Key("name").String(options.processName).EndObject().EndObject();
-        emit(w);
-    }
+    emit(json{{"name", "process_name"}, {"ph", "M"}, {"pid", kPid}, {"tid", 0},
+              {"args", {{"name", options.processName}}}});
     for (uint32_t c : cpus) {
-        JsonWriter w(0);
-        w.BeginObject().Key("name").String("thread_name").Key("ph").String("M");
-        w.Key("pid").Integer(kPid).Key("tid").Unsigned(c);
-        w.Key("args").BeginObject().Key("name").String("CPU " + std::to_string(c)).EndObject().EndObject();
-        emit(w);
-        JsonWriter s(0);
-        s.BeginObject().Key("name").String("thread_sort_index").Key("ph").String("M");
-        s.Key("pid").Integer(kPid).Key("tid").Unsigned(c);
-        s.Key("args").BeginObject().Key("sort_index").Unsigned(c).EndObject().EndObject();
-        emit(s);
+        emit(json{{"name", "thread_name"}, {"ph", "M"}, {"pid", kPid}, {"tid", c},
+                  {"args", {{"name", "CPU " + std::to_string(c)}}}});
+        emit(json{{"name", "thread_sort_index"}, {"ph", "M"}, {"pid", kPid}, {"tid", c},
+                  {"args", {{"sort_index", c}}}});
     }
 
+    auto entry = [&](uint32_t i) {
+        TraceEntry e;
+        e.event = r.events[i];
+        e.data = r.data != nullptr ? r.data[i] : kLogNoData;
+        e.tsUs = MicrosSince(TimeOf(r, i), origin);
+        return e;
+    };
     auto instant = [&](uint32_t i, const TraceEventInfo& info) {
-        JsonWriter w(0);
-        w.BeginObject();
-        Common(w, info, "i", TraceCpuOf(r.events[i]), MicrosSince(TimeOf(r, i), origin));
-        w.Key("s").String("t");
-        if (r.data != nullptr && r.data[i] != kNoData) {
-            w.Key("args").BeginObject().Key("data").Unsigned(r.data[i]).EndObject();
-        }
-        w.EndObject();
-        emit(w);
+        json e = Event(info, "i", TraceCpuOf(r.events[i]), MicrosSince(TimeOf(r, i), origin));
+        e["s"] = "t";
+        if (!info.args.empty()) e["args"] = info.args;
+        emit(e);
     };
 
     struct Open {
@@ -97,7 +92,7 @@ std::string ExportChromeTrace(const LogReadOut& r, const TraceDescribeFn& descri
     };
     std::map<uint32_t, Open> open;  // span key -> its unmatched begin
     for (uint32_t i = 0; i < count; ++i) {
-        TraceEventInfo info = describe(r.events[i]);
+        TraceEventInfo info = describe(entry(i));
         switch (info.phase) {
             case TracePhase::Instant:
                 instant(i, info);
@@ -108,7 +103,7 @@ std::string ExportChromeTrace(const LogReadOut& r, const TraceDescribeFn& descri
                     instant(it->second.index, it->second.info);
                     open.erase(it);
                 }
-                open.emplace(info.spanKey, Open{i, info});
+                open.emplace(info.spanKey, Open{i, std::move(info)});
                 break;
             }
             case TracePhase::End: {
@@ -118,22 +113,18 @@ std::string ExportChromeTrace(const LogReadOut& r, const TraceDescribeFn& descri
                     break;
                 }
                 const uint32_t b = it->second.index;
+                const TraceEventInfo& begin = it->second.info;
                 const double ts = MicrosSince(TimeOf(r, b), origin);
                 const uint32_t beginCpu = TraceCpuOf(r.events[b]);
                 const uint32_t endCpu = TraceCpuOf(r.events[i]);
-                JsonWriter w(0);
-                w.BeginObject();
-                Common(w, it->second.info, "X", beginCpu, ts);
-                w.Key("dur").Number(MicrosSince(TimeOf(r, i), origin) - ts, 3);
-                const bool data = r.data != nullptr && r.data[i] != kNoData;
-                if (endCpu != beginCpu || data) {
-                    w.Key("args").BeginObject();
-                    if (endCpu != beginCpu) w.Key("end_cpu").Unsigned(endCpu);
-                    if (data) w.Key("data").Unsigned(r.data[i]);
-                    w.EndObject();
-                }
-                w.EndObject();
-                emit(w);
+                TraceEventInfo span = info.name.empty() ? begin : info;
+                json e = Event(span, "X", beginCpu, ts);
+                e["dur"] = std::round((MicrosSince(TimeOf(r, i), origin) - ts) * 1000.0) / 1000.0;
+                json args = begin.args;
+                for (auto& [k, v] : info.args.items()) args[k] = v;
+                if (endCpu != beginCpu) args["end_cpu"] = endCpu;
+                if (!args.empty()) e["args"] = std::move(args);
+                emit(e);
                 open.erase(it);
                 break;
             }
@@ -141,14 +132,9 @@ std::string ExportChromeTrace(const LogReadOut& r, const TraceDescribeFn& descri
     }
     for (auto& [key, o] : open) instant(o.index, o.info);
 
-    std::string out = "{\"traceEvents\":[\n";
-    for (std::size_t i = 0; i < events.size(); ++i) {
-        out += events[i];
-        out += i + 1 < events.size() ? ",\n" : "\n";
-    }
-    out += "],\n\"displayTimeUnit\":\"ns\",\n\"otherData\":{\"clock\":\"";
-    out += JsonEscape(options.clockNote);
-    out += "\",\"origin_ns\":" + std::to_string(origin) + ",\"entries\":" + std::to_string(count) + "}}\n";
+    out += "\n],\n\"displayTimeUnit\":\"ns\",\n\"otherData\":";
+    out += json{{"clock", options.clockNote}, {"origin_ns", origin}, {"entries", count}}.dump();
+    out += "}\n";
     return out;
 }
 

@@ -60,7 +60,7 @@ contents "$dev_deb" >"$SCRATCH/dev.txt"
 expect_same_list "libquelta6 contents" "$SCRATCH/runtime.txt" "$SCRATCH/expected-runtime.txt"
 expect_same_list "libquelta-dev contents" "$SCRATCH/dev.txt" "$SCRATCH/expected-dev.txt"
 if [ "${HAS_PROBE:-0}" = 1 ] && [ -f "$out/$tools_deb" ]; then
-  echo "$BINDIR/quelta-probe" >"$SCRATCH/expected-tools.txt"
+  printf "%s\n" "$BINDIR/quelta-probe" "share/man/man1/quelta-probe.1.gz" >"$SCRATCH/expected-tools.txt"
   contents "$tools_deb" >"$SCRATCH/tools.txt"
   expect_same_list "quelta-tools contents" "$SCRATCH/tools.txt" "$SCRATCH/expected-tools.txt"
 fi

@@ -12,7 +12,7 @@ lib="$prefix/$LIBDIR"
 {
   expected_runtime_files
   expected_development_files
-  if [ "${HAS_PROBE:-0}" = 1 ]; then echo "$BINDIR/quelta-probe"; fi
+  if [ "${HAS_PROBE:-0}" = 1 ]; then echo "$BINDIR/quelta-probe"; echo "share/man/man1/quelta-probe.1.gz"; fi
 } | LC_ALL=C sort >"$SCRATCH/expected.txt"
 tree_of "$prefix" >"$SCRATCH/found.txt"
 expect_same_list "installed tree" "$SCRATCH/found.txt" "$SCRATCH/expected.txt"

@@ -1,38 +1,57 @@
-// quelta-probe as a user runs it: a short survey with every output file, and
-// the errors and exit statuses of bad command lines.
+// quelta-probe as a user runs it: a short survey with every output, a
+// survey ended by a signal, a run without real-time privilege, the probe
+// outside its build tree, and bad command lines refused before any survey.
 #include <gtest/gtest.h>
-#include <stdio.h>
+#include <fcntl.h>
+#include <linux/capability.h>
+#include <signal.h>
+#include <sys/prctl.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <chrono>
+#include <cmath>
 #include <cstdlib>
 #include <fstream>
+#include <functional>
+#include <map>
+#include <nlohmann/json.hpp>
+#include <sstream>
 #include <string>
+#include <thread>
+#include <vector>
 
 #include "TestSupport.h"
-#include "probe_json_reader.h"
 
-using probejson::Value;
+using nlohmann::json;
 
 namespace {
 
 const std::string kProbe = std::string(QUELTA_BINARY_DIR) + "/tools/quelta-probe";
+const char* const kSeries[] = {"baseline", "plain-wait", "tick", "event-own-sem", "event-timeout", "global-wait",
+                               "callback-time"};
+
+std::string ReadFile(const std::string& path) {
+    std::ifstream in(path, std::ios::binary);
+    return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+}
+
+std::vector<std::string> Lines(const std::string& text) {
+    std::vector<std::string> out;
+    std::istringstream in(text);
+    for (std::string l; std::getline(in, l);) out.push_back(l);
+    return out;
+}
+
+bool Exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
 
 struct ProbeRun {
-    int status = -1;
-    std::string output;  // stdout and stderr
+    int status = -1;  // exit status, or -1 when it did not exit
+    std::string out, err;
 };
-
-ProbeRun Probe(const std::string& args) {
-    ProbeRun r;
-    FILE* p = popen((kProbe + " " + args + " 2>&1 </dev/null").c_str(), "r");
-    if (p == nullptr) return r;
-    char buf[512];
-    while (fgets(buf, sizeof buf, p)) r.output += buf;
-    const int s = pclose(p);
-    r.status = WIFEXITED(s) ? WEXITSTATUS(s) : -1;
-    return r;
-}
 
 class ProbeCli : public ::testing::Test {
 protected:
@@ -45,88 +64,330 @@ protected:
     void TearDown() override {
         if (!dir_.empty()) std::system(("rm -rf '" + dir_ + "'").c_str());
     }
+
+    // Runs `binary args...` with standard output and error in files; `child`
+    // runs in the child before exec, `during` in the parent while it runs.
+    ProbeRun Run(const std::vector<std::string>& args, const std::function<void()>& child = {},
+                 const std::function<void(pid_t)>& during = {}, const std::string& binary = kProbe) {
+        const std::string out = dir_ + "/stdout", err = dir_ + "/stderr";
+        unlink(out.c_str());  // nothing of an earlier run for `during` to see
+        unlink(err.c_str());
+        const pid_t pid = fork();
+        if (pid == 0) {
+            const int in = open("/dev/null", O_RDONLY);
+            const int o = open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+            const int e = open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+            dup2(in, 0), dup2(o, 1), dup2(e, 2);
+            if (child) child();
+            std::vector<char*> argv{const_cast<char*>(binary.c_str())};
+            for (const std::string& a : args) argv.push_back(const_cast<char*>(a.c_str()));
+            argv.push_back(nullptr);
+            execv(binary.c_str(), argv.data());
+            _exit(127);
+        }
+        ProbeRun r;
+        if (pid < 0) return r;
+        if (during) during(pid);
+        int status = 0;
+        waitpid(pid, &status, 0);
+        r.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+        r.out = ReadFile(out);
+        r.err = ReadFile(err);
+        return r;
+    }
+
     std::string dir_;
 };
 
-TEST_F(ProbeCli, ShortSurveyWritesEveryOutput) {
-    const std::string json = dir_ + "/p.json", svg = dir_ + "/p.svg", trace = dir_ + "/t.json";
-    const ProbeRun r = Probe("--duration 2 --json " + json + " --svg " + svg + " --trace " + trace);
-    // Without real-time privilege the library's timer thread does not serve,
-    // and its event waits return at once: the probe reports that (status 3).
-    const bool realtime = testsupport::CanUseRealtime();
-    ASSERT_TRUE(r.status == 0 || (!realtime && r.status == 3)) << r.output;
-    EXPECT_NE(r.output.find("baseline"), std::string::npos) << r.output;
-    EXPECT_NE(r.output.find("ns/call"), std::string::npos) << r.output;
-    EXPECT_EQ(r.output.find('\r'), std::string::npos);  // no progress line without a terminal
-    Value doc;
-    ASSERT_TRUE(probejson::Parse(probejson::ReadFile(json), doc));
-    EXPECT_EQ(doc["schema"].s, "quelta-probe/1");
-    EXPECT_GE(doc["duration_s"].n, 2.0);
-    EXPECT_GE(doc["machine"]["cpus"].n, 1);
-    const char* names[] = {"baseline", "plain-wait", "tick", "event-own-sem", "event-timeout", "global-wait",
-                           "callback-time"};
-    ASSERT_EQ(doc["series"].items.size(), 7u);
-    for (std::size_t i = 0; i < 7; ++i) {
-        const Value& s = doc["series"][i];
-        EXPECT_EQ(s["name"].s, names[i]);
-        if (!realtime) continue;
-        EXPECT_GT(s["count"].n, 10) << names[i];
-        EXPECT_EQ(s["early"].n, 0) << names[i];
-        EXPECT_EQ(s["failed"].n, 0) << names[i];
-        EXPECT_GE(s["min"].n, 0) << names[i];
-        EXPECT_LE(s["p50"].n, s["p99"].n);
+// The CSV's rows per series, after checking the header and every row's shape.
+std::map<std::string, int> CsvCounts(const std::string& text) {
+    const std::vector<std::string> lines = Lines(text);
+    EXPECT_FALSE(lines.empty());
+    if (lines.empty()) return {};
+    EXPECT_EQ(lines[0], "time_s,series,lateness_us");
+    std::map<std::string, int> counts;
+    for (std::size_t i = 1; i < lines.size(); ++i) {
+        char name[64];
+        double t = 0, late = 0;
+        const bool ok = std::sscanf(lines[i].c_str(), "%lf,%63[^,],%lf", &t, name, &late) == 3;
+        EXPECT_TRUE(ok && t > -1.0) << lines[i];
+        if (ok) ++counts[name];
     }
-    ASSERT_GE(doc["costs"].items.size(), 7u);
-    for (const Value& c : doc["costs"].items) EXPECT_GT(c["ns_per_call"].n, 0) << c["name"].s;
-
-    Value t;
-    ASSERT_TRUE(probejson::Parse(probejson::ReadFile(trace), t));
-    int spans = 0, tracks = 0, ticks = 0;
-    for (const Value& e : t["traceEvents"].items) {
-        spans += e["ph"].s == "X";
-        tracks += e["ph"].s == "M" && e["name"].s == "thread_name";
-        ticks += e["ph"].s == "i" && e["name"].s == "tick";
-    }
-    EXPECT_GT(spans, 60);  // every sample a span
-    EXPECT_TRUE(!realtime || ticks > 100) << ticks;
-    EXPECT_EQ(tracks, static_cast<int>(doc["machine"]["cpus"].n));
-
-    const std::string svgText = probejson::ReadFile(svg);
-    EXPECT_EQ(svgText.rfind("<?xml", 0), 0u);
-    int curves = 0;
-    for (auto p = svgText.find("<polyline"); p != std::string::npos; p = svgText.find("<polyline", p + 1)) ++curves;
-    EXPECT_EQ(curves, 7);
+    return counts;
 }
 
-// --help prints a manual page; bad usage exits with 1 and points at --help,
-// library problems with 2, an unwritable output with 4: none runs a survey.
-TEST_F(ProbeCli, ErrorsExitWithTheirStatus) {
+// The histogram file: rows 0 .. maxUs-1 with one column per series, then the
+// summary; returns Total + Early Returns per column.
+std::vector<long> HistogramCounts(const std::string& text, int maxUs) {
+    int rows = 0;
+    std::vector<long> total, early;
+    for (const std::string& l : Lines(text)) {
+        if (l.rfind("#", 0) != 0) {
+            std::istringstream in(l);
+            std::string bucket;
+            in >> bucket;
+            EXPECT_EQ(std::stoi(bucket), rows) << l;
+            int columns = 0;
+            for (long n; in >> n;) ++columns;
+            EXPECT_EQ(columns, 7) << l;
+            ++rows;
+            continue;
+        }
+        for (auto [prefix, into] : {std::pair{"# Total:", &total}, std::pair{"# Early Returns:", &early}}) {
+            if (l.rfind(prefix, 0) != 0) continue;
+            std::istringstream in(l.substr(std::string(prefix).size()));
+            for (long n; in >> n;) into->push_back(n);
+        }
+    }
+    EXPECT_EQ(rows, maxUs);
+    EXPECT_EQ(total.size(), 7u);
+    EXPECT_EQ(early.size(), 7u);
+    for (std::size_t i = 0; i < std::min(total.size(), early.size()); ++i) total[i] += early[i];
+    return total;
+}
+
+// A two-second survey on one CPU with every output; the JSON to standard
+// output, the tables to standard error. Every file agrees with the JSON.
+TEST_F(ProbeCli, SurveyWritesEveryOutput) {
+    const bool realtime = testsupport::CanUseRealtime();
+    const int cpu = static_cast<int>(sysconf(_SC_NPROCESSORS_ONLN)) - 1;
+    const std::string svg = dir_ + "/p.svg", trace = dir_ + "/t.json", csv = dir_ + "/s.csv", hist = dir_ + "/h.txt";
+    const ProbeRun r = Run({"--duration", "2", "--json", "-", "--svg", svg, "--trace", trace, "--csv", csv,
+                            "--histogram", hist, "--histogram-max", "2000", "--cpu", std::to_string(cpu),
+                            "--priority", "50"});
+    ASSERT_EQ(r.status, 0) << r.out << r.err;
+    ASSERT_TRUE(json::accept(r.out)) << r.out;  // nothing but the JSON on standard output
+    const json doc = json::parse(r.out);
+    for (const char* text : {"baseline", "p99/base", "files:", svg.c_str(), trace.c_str(), csv.c_str(), hist.c_str(),
+                             "standard output"}) {
+        EXPECT_NE(r.err.find(text), std::string::npos) << text << "\n" << r.err;
+    }
+    EXPECT_EQ(r.err.find('\r'), std::string::npos);  // no progress line without a terminal
+    EXPECT_EQ(doc["library"], std::string(QUELTA_BINARY_DIR) + "/libquelta.so.6");  // the one built here
+    EXPECT_GE(doc["duration_s"].get<double>(), 2.0);
+    EXPECT_EQ(doc["survey_cpus"], json({cpu}));
+    EXPECT_EQ(doc["machine"]["priority"], realtime ? 50 : 0);
+    ASSERT_EQ(doc["series"].size(), 7u);
+    std::map<std::string, long> counts;
+    for (std::size_t i = 0; i < 7; ++i) {
+        const json& s = doc["series"][i];
+        EXPECT_EQ(s["name"], kSeries[i]);
+        EXPECT_EQ(s["early"], 0) << kSeries[i];
+        counts[kSeries[i]] = s["count"].get<long>();
+        if (!realtime && i != 0 && i != 1) continue;
+        EXPECT_TRUE(s["measured"].get<bool>()) << kSeries[i];
+        EXPECT_GT(s["count"].get<long>(), 10) << kSeries[i];
+        EXPECT_EQ(s["failed"], 0) << kSeries[i];
+    }
+    EXPECT_GE(doc["costs"].size(), 7u);
+
+    // CSV and histogram hold every sample of every series.
+    const std::map<std::string, int> rows = CsvCounts(ReadFile(csv));
+    const std::vector<long> columns = HistogramCounts(ReadFile(hist), 2000);
+    for (std::size_t i = 0; i < 7; ++i) {
+        const auto it = rows.find(kSeries[i]);
+        EXPECT_EQ(it == rows.end() ? 0 : it->second, counts[kSeries[i]]) << kSeries[i];
+        if (i < columns.size()) EXPECT_EQ(columns[i], counts[kSeries[i]]) << kSeries[i];
+    }
+
+    // The trace: every wait a span on the survey's CPU, with its deadline
+    // and lateness; the late ones named so, and later than the baseline's p99.
+    const json t = json::parse(ReadFile(trace));
+    const double baseP99 = doc["series"][0]["p99"].get<double>();
+    int spans = 0, late = 0;
+    for (const json& e : t["traceEvents"]) {
+        if (e["ph"] != "X") continue;
+        ++spans;
+        const std::string name = e["name"];
+        ASSERT_TRUE(e["args"].contains("deadline_us") && e["args"].contains("lateness_us")) << e.dump();
+        const double lateness = e["args"]["lateness_us"].get<double>();
+        EXPECT_NEAR(e["args"]["deadline_us"].get<double>() + lateness, e["ts"].get<double>() + e["dur"].get<double>(),
+                    50.0) << e.dump();
+        EXPECT_EQ(name.find(" LATE") != std::string::npos, lateness > baseP99) << e.dump();
+        late += name.find(" LATE") != std::string::npos;
+        if (name.rfind("callback-time", 0) != 0) EXPECT_EQ(e["tid"], cpu) << e.dump();
+    }
+    EXPECT_GT(spans, 60);
+    EXPECT_LT(late, spans);
+
+    const std::string plot = ReadFile(svg);
+    int curves = 0;
+    for (auto p = plot.find("<polyline"); p != std::string::npos; p = plot.find("<polyline", p + 1)) ++curves;
+    EXPECT_EQ(curves, realtime ? 7 : 2);
+}
+
+// SIGINT or SIGTERM during a survey that would run until interrupted: it
+// stops, prints the tables and writes every file for what was measured.
+TEST_F(ProbeCli, SignalEndsASurveyWithTheFilesWritten) {
+    for (int sig : {SIGINT, SIGTERM}) {
+        SCOPED_TRACE(strsignal(sig));
+        const std::string js = dir_ + "/p.json", csv = dir_ + "/s.csv", hist = dir_ + "/h.txt", svg = dir_ + "/p.svg",
+                          trace = dir_ + "/t.json";
+        for (const std::string& f : {js, csv, hist, svg, trace}) unlink(f.c_str());
+        const auto start = std::chrono::steady_clock::now();
+        const ProbeRun r = Run({"--duration", "0", "--interval", "1", "--json", js, "--csv", csv, "--histogram", hist,
+                                "--svg", svg, "--trace", trace},
+                               {}, [&](pid_t pid) {
+                                   // Until the first summary line is out (or 30 s).
+                                   for (int i = 0; i < 300 && ReadFile(dir_ + "/stdout").find("wakes,") ==
+                                                                   std::string::npos; ++i) {
+                                       std::this_thread::sleep_for(std::chrono::milliseconds(100));
+                                   }
+                                   kill(pid, sig);
+                               });
+        ASSERT_EQ(r.status, 0) << r.out << r.err;
+        EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(60));
+        EXPECT_NE(r.out.find("stopping the survey"), std::string::npos) << r.out;
+        EXPECT_NE(r.out.find(" wakes, 0 early; worst us (last 1 s / all): baseline "), std::string::npos) << r.out;
+        EXPECT_NE(r.out.find("p99/base"), std::string::npos) << r.out;
+        const json doc = json::parse(ReadFile(js));
+        EXPECT_EQ(doc["interrupted"], true);
+        EXPECT_GT(doc["duration_s"].get<double>(), 0.5);
+        EXPECT_TRUE(doc["costs"].empty());  // skipped after a signal
+        long total = 0;
+        for (const json& s : doc["series"]) total += s["count"].get<long>();
+        EXPECT_GT(doc["series"][0]["count"].get<long>(), 10);
+        int csvRows = 0;
+        for (const auto& [name, n] : CsvCounts(ReadFile(csv))) csvRows += n;
+        EXPECT_EQ(csvRows, total);
+        long histTotal = 0;
+        for (long n : HistogramCounts(ReadFile(hist), 10000)) histTotal += n;
+        EXPECT_EQ(histTotal, total);
+        EXPECT_NE(ReadFile(svg).find("curve-baseline"), std::string::npos);
+        EXPECT_TRUE(json::accept(ReadFile(trace)));
+    }
+}
+
+// capset(2) without libcap: drop one capability from what an exec keeps.
+void DropCapability(int cap) {
+    prctl(PR_CAPBSET_DROP, cap, 0, 0, 0);
+    prctl(PR_CAP_AMBIENT, PR_CAP_AMBIENT_CLEAR_ALL, 0, 0, 0);
+    __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
+    __user_cap_data_struct data[2] = {};
+    if (syscall(SYS_capget, &header, data) != 0) return;
+    for (auto& d : data) {
+        const unsigned bit = 1u << (cap % 32);
+        if (&d - data == cap / 32) d.inheritable &= ~bit, d.permitted &= ~bit, d.effective &= ~bit;
+    }
+    syscall(SYS_capset, &header, data);
+}
+
+// A user without real-time privilege (no CAP_SYS_NICE, RLIMIT_RTPRIO 0): the
+// library has no timer thread, as documented; the probe measures the
+// baseline and the plain waits, shows the rest as not measured, and exits 0.
+TEST_F(ProbeCli, WithoutRealtimePrivilegeThePlainSeriesAreMeasured) {
+    const std::string js = dir_ + "/p.json";
+    const ProbeRun r = Run({"--duration", "1", "--json", js}, [] {
+        const rlimit none{0, 0};
+        setrlimit(RLIMIT_RTPRIO, &none);
+        DropCapability(CAP_SYS_NICE);
+    });
+    ASSERT_EQ(r.status, 0) << r.out << r.err;
+    EXPECT_EQ(r.out.find("FAILURE"), std::string::npos) << r.out;
+    EXPECT_NE(r.out.find("not measured: needs real-time privilege"), std::string::npos) << r.out;
+    const json doc = json::parse(ReadFile(js));
+    EXPECT_EQ(doc["machine"]["realtime"], false);
+    EXPECT_EQ(doc["timer_running"], false);
+    for (std::size_t i = 0; i < 7; ++i) {
+        const json& s = doc["series"][i];
+        const bool plain = i <= 1;
+        EXPECT_EQ(s["measured"], plain) << kSeries[i];
+        EXPECT_EQ(s["early"], 0) << kSeries[i];
+        if (plain) EXPECT_GT(s["count"].get<long>(), 10) << kSeries[i];
+        else EXPECT_EQ(s["count"], 0) << kSeries[i];
+    }
+}
+
+// Outside its build tree the probe loads libquelta.so.6 through the dynamic
+// loader's search, as an installed probe does; nothing points at the build.
+TEST_F(ProbeCli, OutsideTheBuildTreeTheLoaderFindsTheLibrary) {
+    ASSERT_EQ(mkdir((dir_ + "/bin").c_str(), 0755), 0);
+    ASSERT_EQ(mkdir((dir_ + "/lib").c_str(), 0755), 0);
+    const std::string probe = dir_ + "/bin/quelta-probe";
+    ASSERT_EQ(std::system(("cp '" + kProbe + "' '" + probe + "' && cp -L '" + QUELTA_BINARY_DIR +
+                           "/libquelta.so.6' '" + dir_ + "/lib/'").c_str()), 0);
+    const ProbeRun missing = Run({"--duration", "1"}, [] { unsetenv("LD_LIBRARY_PATH"); }, {}, probe);
+    if (missing.status == 2) {  // no system-wide library: it says what it looked for
+        EXPECT_NE(missing.err.find("cannot load library 'libquelta.so.6'"), std::string::npos) << missing.err;
+    }
+    const std::string lib = dir_ + "/lib";
+    const ProbeRun found = Run({"--duration", "1", "--json", "-", "--no-realtime"},
+                               [lib] { setenv("LD_LIBRARY_PATH", lib.c_str(), 1); }, {}, probe);
+    ASSERT_EQ(found.status, 0) << found.err;
+    EXPECT_EQ(json::parse(found.out)["library"], lib + "/libquelta.so.6");
+}
+
+// Bad command lines exit 1 and point at --help, library problems 2, outputs
+// that cannot be written 4: all before any survey, leaving no files behind.
+TEST_F(ProbeCli, ErrorsExitWithTheirStatusBeforeAnySurvey) {
     const std::string notLib = dir_ + "/not-a-library.so";
     std::ofstream(notLib) << "not an ELF file\n";
+    const std::string left = dir_ + "/left.json";
     const struct {
-        std::string args;
+        std::vector<std::string> args;
         int status;
         const char* message;
     } cases[] = {
-        {"--help", 0, "\nEXIT STATUS\n"},
-        {"--duration 0", 1, "out of range"},
-        {"--duration 3601", 1, "out of range"},
-        {"--duration 2x", 1, "whole number"},
-        {"--duration", 1, "needs a value"},
-        {"--bogus", 1, "unknown option '--bogus'"},
-        {"extra", 1, "unexpected argument 'extra'"},
-        {"--library " + dir_ + "/missing/libquelta.so.6", 2, "No such file"},
-        {"--library " + notLib, 2, "cannot load library"},
-        {"--library libm.so.6", 2, "lacks symbol"},  // loads, but is not this library
-        {"--duration 1 --json " + dir_ + "/no/such/dir/p.json", 4, "--json"},
+        {{"--help"}, 0, "\nEXIT STATUS\n"},
+        {{"--version"}, 0, "quelta-probe 6."},
+        {{"--duration", "2x"}, 1, "--duration"},
+        {{"--duration", "31d"}, 1, "30 d"},
+        {{"--duration"}, 1, "--duration"},
+        {{"--bogus"}, 1, "--bogus"},
+        {{"extra"}, 1, "extra"},
+        {{"--cpu", "3-1"}, 1, "--cpu"},
+        {{"--cpu", "1023"}, 1, "not online"},
+        {{"--priority", "99"}, 1, "--priority"},
+        {{"--priority", "5", "--no-realtime"}, 1, "contradict"},
+        {{"--histogram-max", "10001"}, 1, "--histogram-max"},
+        {{"--json", "-", "--csv", "-"}, 1, "only one output"},
+        {{"--library", dir_ + "/missing/libquelta.so.6", "--json", left}, 2, "No such file"},
+        {{"--library", notLib}, 2, "cannot load library"},
+        {{"--library", "libm.so.6"}, 2, "lacks symbol"},  // loads, but is not this library
+        {{"--json", dir_ + "/no/such/dir/p.json"}, 4, "--json"},
+        {{"--csv", left, "--histogram", dir_}, 4, "is a directory"},
     };
     for (const auto& c : cases) {
-        const ProbeRun r = Probe(c.args);
-        EXPECT_EQ(r.status, c.status) << c.args << ": " << r.output;
-        EXPECT_NE(r.output.find(c.message), std::string::npos) << c.args << ": " << r.output;
-        EXPECT_TRUE(c.status != 1 || r.output.find("--help") != std::string::npos) << c.args;
-        EXPECT_TRUE(c.status == 0 ? r.output.rfind("NAME\n", 0) == 0 : r.output.find("ns/call") == std::string::npos)
-            << c.args;
+        std::string line;
+        for (const std::string& a : c.args) line += a + " ";
+        const ProbeRun r = Run(c.args);
+        const std::string all = r.out + r.err;
+        EXPECT_EQ(r.status, c.status) << line << ": " << all;
+        EXPECT_NE(all.find(c.message), std::string::npos) << line << ": " << all;
+        EXPECT_TRUE(c.status != 1 || r.err.find("--help") != std::string::npos) << line;
+        EXPECT_EQ(all.find("p99/base"), std::string::npos) << line;  // no survey ran
+        EXPECT_FALSE(Exists(left)) << line;                           // nor left a file
+    }
+}
+
+// Every option is accepted, and named in --help and in the manual page, which
+// the build installs compressed and which renders without warnings.
+TEST_F(ProbeCli, ManualPageAndHelpNameEveryOption) {
+    const std::string help = Run({"--help"}).out;
+    const std::string page = ReadFile(std::string(QUELTA_SOURCE_DIR) + "/docs/quelta-probe.1");
+    const std::pair<const char*, const char*> options[] = {
+        {"--duration", "5"}, {"--interval", "5"}, {"--cpu", "0"}, {"--priority", "5"}, {"--no-realtime", nullptr},
+        {"--library", "x"},  {"--json", "x"},     {"--svg", "x"}, {"--trace", "x"},    {"--csv", "x"},
+        {"--histogram", "x"}, {"--histogram-max", "5"}, {"--help", nullptr}, {"--version", nullptr}};
+    for (const auto& [name, value] : options) {
+        EXPECT_NE(help.find(name), std::string::npos) << name;
+        std::string roff;
+        for (char ch : std::string(name)) roff += ch == '-' ? "\\-" : std::string(1, ch);
+        EXPECT_NE(page.find(roff), std::string::npos) << name;
+        std::vector<std::string> args{name};
+        if (value) args.push_back(value);
+        if (std::string(name) != "--help") args.push_back("--version");  // parsed, then nothing runs
+        EXPECT_EQ(Run(args).status, 0) << name;
+    }
+    const std::string gz = std::string(QUELTA_BINARY_DIR) + "/tools/quelta-probe.1.gz";
+    ASSERT_TRUE(Exists(gz));
+    EXPECT_EQ(std::system(("gzip -dc '" + gz + "' | cmp -s - '" + QUELTA_SOURCE_DIR + "/docs/quelta-probe.1'").c_str()),
+              0);
+    if (std::system("command -v man >/dev/null 2>&1") == 0) {
+        const std::string warn = dir_ + "/man.txt";
+        std::system(("LC_ALL=C.UTF-8 MANROFFSEQ='' MANWIDTH=80 man --warnings -E UTF-8 -l -Tutf8 -Z '" +
+                     std::string(QUELTA_SOURCE_DIR) + "/docs/quelta-probe.1' >/dev/null 2>'" + warn + "'").c_str());
+        EXPECT_EQ(ReadFile(warn), "");
     }
 }
 

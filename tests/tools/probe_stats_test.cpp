@@ -1,4 +1,4 @@
-// Statistics of a latency series, the verdict against the baseline, and the
+// Latency histograms, the statistics and verdicts built on them, and the
 // rebuilt lateness of the library's tick.
 #include <gtest/gtest.h>
 
@@ -7,9 +7,11 @@
 #include <random>
 #include <vector>
 
+#include "LatencyHistogram.h"
 #include "Stats.h"
 #include "TickGrid.h"
 
+using qtools::LatencyHistogram;
 using qtools::Summarize;
 using qtools::Summary;
 using qtools::VerdictFor;
@@ -32,29 +34,60 @@ Summary WithP99(double p99, double p50 = 1.0) {
 }
 
 // Nearest rank, whatever the order of arrival: p99.9 of 1000 values is the
-// 999th, not the maximum; with few values every percentile is a sample.
+// 999th, not the maximum; with few values every percentile is a sample; the
+// tenths of a microsecond survive.
 TEST(ProbeStats, NearestRankPercentilesOnKnownData) {
     std::vector<double> shuffled = OneToN(100);
     std::shuffle(shuffled.begin(), shuffled.end(), std::mt19937(7));
+    std::vector<double> tenths;
+    for (int i = 1; i <= 10; ++i) tenths.push_back(12.0 + i / 10.0);  // 12.1 .. 13.0
     const std::pair<std::vector<double>, std::vector<double>> cases[] = {  // count min p50 p90 p99 p999 max
         {shuffled, {100, 1, 50, 90, 99, 100, 100}},
         {OneToN(1000), {1000, 1, 500, 900, 990, 999, 1000}},
         {{4, 1, 3, 2}, {4, 1, 2, 4, 4, 4, 4}},
-        {{7.5}, {1, 7.5, 7.5, 7.5, 7.5, 7.5, 7.5}}};
+        {{7.5}, {1, 7.5, 7.5, 7.5, 7.5, 7.5, 7.5}},
+        {tenths, {10, 12.1, 12.5, 12.9, 13.0, 13.0, 13.0}}};
     for (const auto& [values, want] : cases) {
         const Summary s = Summarize(values);
-        EXPECT_EQ(std::vector<double>({double(s.count), s.min, s.p50, s.p90, s.p99, s.p999, s.max}), want);
+        const std::vector<double> got{double(s.count), s.min, s.p50, s.p90, s.p99, s.p999, s.max};
+        ASSERT_EQ(got.size(), want.size());
+        for (std::size_t i = 0; i < got.size(); ++i) EXPECT_NEAR(got[i], want[i], 1e-9) << i;
         EXPECT_EQ(s.early, 0u);
     }
+    EXPECT_DOUBLE_EQ(Summarize({1, 2, 3, 6}).mean, 3.0);
+}
+
+// Beyond 10 ms the buckets are logarithmic: percentiles within 1.2 %, the
+// maximum exact; counts above a point exact at the fine buckets' edges.
+TEST(ProbeStats, LongTailsAndCountsAbove) {
+    LatencyHistogram h;
+    for (int i = 0; i < 900; ++i) h.Add(50.0);
+    for (int i = 1; i <= 100; ++i) h.Add(10000.0 * i);  // 10 ms .. 1 s
+    EXPECT_EQ(h.count(), 1000u);
+    EXPECT_DOUBLE_EQ(h.max(), 1e6);
+    EXPECT_NEAR(h.Percentile(0.95), 500000.0, 500000.0 * 0.012);
+    EXPECT_NEAR(h.Percentile(0.999), 990000.0, 990000.0 * 0.012);
+    EXPECT_EQ(h.CountAbove(49.9), 1000u);
+    EXPECT_EQ(h.CountAbove(50.0), 100u);
+    EXPECT_EQ(h.CountAbove(5000.0), 100u);
+    EXPECT_EQ(h.CountInFine(500, 501), 900u);  // 50.0 us in its 0.1 us bucket
+
+    LatencyHistogram other;
+    other.Add(-3.0);
+    other.Add(2e9);  // beyond every bucket: still counted, still the maximum
+    h.Merge(other);
+    EXPECT_EQ(h.count(), 1002u);
+    EXPECT_EQ(h.early(), 1u);
+    EXPECT_DOUBLE_EQ(h.min(), -3.0);
+    EXPECT_DOUBLE_EQ(h.max(), 2e9);
 }
 
 TEST(ProbeStats, EmptySeriesAndEarlyValues) {
-    const Summary e = Summarize({});
+    const Summary e = Summarize(std::vector<double>{});
     EXPECT_EQ(e.count, 0u);
-    EXPECT_TRUE(std::isnan(e.min) && std::isnan(e.p99) && std::isnan(e.max));
+    EXPECT_TRUE(std::isnan(e.min) && std::isnan(e.p99) && std::isnan(e.max) && std::isnan(e.mean));
     EXPECT_EQ(VerdictFor(e, WithP99(100), false), "no samples");
     EXPECT_TRUE(std::isnan(qtools::RatioP99(e, WithP99(100))));
-    EXPECT_TRUE(std::isnan(qtools::PercentileOfSorted({}, 0.5)));
 
     // Zero is on time; only values below it are early, and they override
     // the verdict, with by how much.

@@ -6,10 +6,11 @@
 #include <string>
 #include <vector>
 
-#include "TraceExport.h"
-#include "probe_json_reader.h"
+#include <nlohmann/json.hpp>
 
-using probejson::Value;
+#include "TraceExport.h"
+
+using Value = nlohmann::json;
 using qtools::TracePhase;
 
 namespace {
@@ -38,14 +39,13 @@ Value Export(const Entries& e, const qtools::TraceDescribeFn& describe = qtools:
     qtools::TraceExportOptions o;
     o.cpuCount = cpuCount;
     const std::string json = qtools::ExportChromeTrace(e.View(), describe, o);
-    Value v;
-    EXPECT_TRUE(probejson::Parse(json, v)) << json;
-    return v;
+    EXPECT_TRUE(Value::accept(json)) << json;
+    return Value::parse(json, nullptr, false);
 }
 
 std::vector<const Value*> Events(const Value& doc, const std::string& ph) {
     std::vector<const Value*> out;
-    for (const Value& e : doc["traceEvents"].items) if (e["ph"].s == ph) out.push_back(&e);
+    for (const Value& e : doc["traceEvents"]) if (e["ph"] == ph) out.push_back(&e);
     return out;
 }
 
@@ -53,7 +53,7 @@ using Track = std::pair<unsigned, std::string>;
 std::vector<Track> Tracks(const Value& doc) {
     std::vector<Track> out;
     for (const Value* m : Events(doc, "M")) {
-        if ((*m)["name"].s == "thread_name") out.emplace_back(unsigned((*m)["tid"].n), (*m)["args"]["name"].s);
+        if ((*m)["name"] == "thread_name") out.emplace_back((*m)["tid"].get<unsigned>(), (*m)["args"]["name"].get<std::string>());
     }
     return out;
 }
@@ -70,14 +70,14 @@ TEST(ProbeTrace, InstantsOnePerEntryOnTheirCpuTrack) {
     const double ts[] = {0.0, 2.5, 1000.0}, tid[] = {0, 1, 3};  // microseconds from the first entry
     for (int i = 0; i < 3; ++i) {
         const Value& in = *instants[i];
-        EXPECT_TRUE(in["pid"].n == 1 && in["tid"].n == tid[i] && in["s"].s == "t") << i;
-        EXPECT_DOUBLE_EQ(in["ts"].n, ts[i]);
+        EXPECT_TRUE(in["pid"] == 1 && in["tid"] == tid[i] && in["s"] == "t") << i;
+        EXPECT_DOUBLE_EQ(in["ts"].get<double>(), ts[i]);
     }
     // The default names leave the CPU bits out.
-    EXPECT_EQ((*instants[1])["name"].s, "event 0x00040007");
-    EXPECT_EQ((*instants[2])["name"].s, "event 0x12000000");
-    EXPECT_FALSE((*instants[0]).has("args"));             // plain recording: no data
-    EXPECT_EQ((*instants[2])["args"]["data"].n, 256);  // data words other than the plain one
+    EXPECT_EQ((*instants[1])["name"], "event 0x00040007");
+    EXPECT_EQ((*instants[2])["name"], "event 0x12000000");
+    EXPECT_FALSE((*instants[0]).contains("args"));     // plain recording: no data
+    EXPECT_EQ((*instants[2])["args"]["data"], 256);  // data words other than the plain one
 
     // One named track per CPU that appears; with a CPU count and nothing
     // read out, one per CPU still, in a valid trace.
@@ -86,48 +86,57 @@ TEST(ProbeTrace, InstantsOnePerEntryOnTheirCpuTrack) {
     const Value empty = Export(Entries{}, qtools::DescribeEventWord, 2);
     EXPECT_TRUE(Events(empty, "i").empty());
     EXPECT_EQ(Tracks(empty), std::vector<Track>({{0, "CPU 0"}, {1, "CPU 1"}}));
-    EXPECT_EQ(empty["otherData"]["entries"].n, 0);
+    EXPECT_EQ(empty["otherData"]["entries"], 0);
 }
 
 
+// Word layout of the caller: bits 0-7 a key, bits 16-23 1 = begin, 2 =
+// end. Begins carry a deadline, ends a lateness; an end later than 5 us
+// renames its span.
 TEST(ProbeTrace, BeginAndEndBecomeOneSpanOnTheBeginsCpu) {
-    // Word layout of the caller: bits 0-7 a key, bits 16-23 1 = begin, 2 = end.
-    auto describe = [](uint32_t w) {
+    auto describe = [](const qtools::TraceEntry& e) {
         qtools::TraceEventInfo info;
-        const uint32_t kind = (w >> 16) & 0xFF;
-        info.name = "wait " + std::to_string(w & 0xFF);
+        const uint32_t kind = (e.event >> 16) & 0xFF;
+        info.name = "wait " + std::to_string(e.event & 0xFF);
         info.phase = kind == 1 ? TracePhase::Begin : kind == 2 ? TracePhase::End : TracePhase::Instant;
-        info.spanKey = w & 0xFF;
+        info.spanKey = e.event & 0xFF;
+        if (kind == 1) info.args["deadline_us"] = e.tsUs + e.data / 1000.0;
+        if (kind == 2) {
+            info.args["lateness_us"] = e.data / 1000.0;
+            info.name = e.data > 5000 ? info.name + " LATE" : "";  // empty: the begin's name
+        }
         return info;
     };
     Entries e;
-    e.Add(kT0, 0x00010005u);                        // begin key 5 on CPU 0
-    e.Add(kT0 + 4000, 0x00010006u | (1u << 8));     // begin key 6 on CPU 1
-    e.Add(kT0 + 30000, 0x00020005u | (1u << 8));    // end key 5 on CPU 1
-    e.Add(kT0 + 31000, 0x00020009u);                // end without a begin
-    e.Add(kT0 + 40000, 0x00020006u | (1u << 8));    // end key 6 on CPU 1
-    e.Add(kT0 + 50000, 0x00010007u);                // begin never ended
+    e.Add(kT0, 0x00010005u, 20000);                     // begin key 5 on CPU 0, deadline 20 us on
+    e.Add(kT0 + 4000, 0x00010006u | (1u << 8), 30000);  // begin key 6 on CPU 1
+    e.Add(kT0 + 30000, 0x00020005u | (1u << 8), 10000); // end key 5 on CPU 1, 10 us late
+    e.Add(kT0 + 31000, 0x00020009u, 0);                 // end without a begin
+    e.Add(kT0 + 40000, 0x00020006u | (1u << 8), 2000);  // end key 6 on CPU 1, 2 us late
+    e.Add(kT0 + 50000, 0x00010007u, 0);                 // begin never ended
     const Value doc = Export(e, describe, 2);
 
     const auto spans = Events(doc, "X");
     ASSERT_EQ(spans.size(), 2u);
-    const struct { const char* name; double tid, ts, dur; } want[] = {{"wait 5", 0, 0, 30}, {"wait 6", 1, 4, 36}};
+    const struct { const char* name; double tid, ts, dur, deadline, late; } want[] = {
+        {"wait 5 LATE", 0, 0, 30, 20, 10}, {"wait 6", 1, 4, 36, 34, 2}};
     for (int i = 0; i < 2; ++i) {
         const Value& sp = *spans[i];
-        EXPECT_EQ(sp["name"].s, want[i].name);
-        EXPECT_EQ(sp["tid"].n, want[i].tid);
-        EXPECT_DOUBLE_EQ(sp["ts"].n, want[i].ts);
-        EXPECT_DOUBLE_EQ(sp["dur"].n, want[i].dur);
+        EXPECT_EQ(sp["name"], want[i].name);
+        EXPECT_EQ(sp["tid"], want[i].tid);
+        EXPECT_DOUBLE_EQ(sp["ts"].get<double>(), want[i].ts);
+        EXPECT_DOUBLE_EQ(sp["dur"].get<double>(), want[i].dur);
+        EXPECT_DOUBLE_EQ(sp["args"]["deadline_us"].get<double>(), want[i].deadline);
+        EXPECT_DOUBLE_EQ(sp["args"]["lateness_us"].get<double>(), want[i].late);
     }
-    EXPECT_EQ((*spans[0])["args"]["end_cpu"].n, 1);  // ended on another CPU
-    EXPECT_FALSE((*spans[1]).has("args"));
+    EXPECT_EQ((*spans[0])["args"]["end_cpu"], 1);  // ended on another CPU
+    EXPECT_FALSE((*spans[1])["args"].contains("end_cpu"));
 
     // The lone end and the lone begin are kept as instants.
     const auto instants = Events(doc, "i");
     ASSERT_EQ(instants.size(), 2u);
-    EXPECT_EQ((*instants[0])["name"].s, "wait 9");
-    EXPECT_DOUBLE_EQ((*instants[0])["ts"].n, 31.0);
-    EXPECT_EQ((*instants[1])["name"].s, "wait 7");
+    EXPECT_DOUBLE_EQ((*instants[0])["ts"].get<double>(), 31.0);
+    EXPECT_EQ((*instants[1])["name"], "wait 7");
 }
 
 }  // namespace

@@ -1,6 +1,7 @@
 #include "probe/LoadedQuelta.h"
 
 #include <dlfcn.h>
+#include <link.h>
 #include <sys/stat.h>
 
 #include <cerrno>
@@ -21,8 +22,18 @@ void LoadedQuelta::Unload() {
     }
 }
 
+std::string LoadedQuelta::ResolvedPath() const {
+    link_map* map = nullptr;
+    if (handle_ != nullptr && dlinfo(handle_, RTLD_DI_LINKMAP, &map) == 0 && map != nullptr && map->l_name &&
+        map->l_name[0] != '\0') {
+        return map->l_name;
+    }
+    return path_;
+}
+
 bool LoadedQuelta::Load(const std::string& path) {
     Unload();
+    path_ = path;
     // A path with a slash names a file: say plainly when it is not one. A bare
     // name is left to the dynamic loader's search, as a runtime would.
     if (path.find('/') != std::string::npos) {

@@ -32,6 +32,9 @@ public:
     void Unload();
 
     const std::string& error() const { return error_; }
+    // The file the loader actually opened (a bare name resolved), or the
+    // name given when the loader does not say.
+    std::string ResolvedPath() const;
     const QueltaEntries& fn() const { return fn_; }
     iKPusTimingEngine* engine() const { return engine_; }
     iKPLogEngine* log() const { return log_; }
@@ -42,6 +45,7 @@ private:
     iKPusTimingEngine* engine_ = nullptr;
     iKPLogEngine* log_ = nullptr;
     std::string error_;
+    std::string path_;
 };
 
 }  // namespace qprobe

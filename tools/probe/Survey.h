@@ -1,14 +1,28 @@
-// The survey: interleaved lateness samples of every series, the library's
-// tick seen from a tick callback, the probe's own log read out for the
-// trace, then the call costs. Everything runs on one worker thread
-// (SCHED_FIFO when allowed) while the calling thread shows progress.
+// The survey: interleaved lateness samples of every series on one worker
+// thread (SCHED_FIFO when allowed, on the chosen CPUs), the library's tick
+// seen from a tick callback, the probe's own log read out for the trace,
+// then the call costs.
+//
+// Threads: the worker samples and keeps the sampled series' histograms (read
+// by others only after it has been joined); the library's timer thread runs
+// the tick and callback-time callbacks; the thread that started the survey
+// (the probe's main thread) calls Poll() every so often, which drains the
+// samples and ticks that the other two hand over through lock-free rings,
+// rebuilds the tick's lateness in chunks, and passes every sample to a sink
+// (the CSV file, the summary lines). RequestStop() may be called from that
+// thread at any time (a signal arrived); the worker stops within one sample.
 #ifndef QUELTA_PROBE_SURVEY_H
 #define QUELTA_PROBE_SURVEY_H
 
+#include <pthread.h>
+
+#include <atomic>
 #include <cstdint>
+#include <memory>
 #include <string>
 #include <vector>
 
+#include "LatencyHistogram.h"
 #include "ProbeReport.h"
 #include "TraceExport.h"
 #include "probe/LoadedQuelta.h"
@@ -33,8 +47,8 @@ enum SeriesId : uint32_t {
 enum LogKind : uint32_t {
     kKindStart = 1,  // a series starts
     kKindEnd = 2,    // a series ends
-    kKindWait = 3,   // a wait begins (or a callback time is set)
-    kKindWake = 4,   // the waiter woke (or the callback ran, or a tick)
+    kKindWait = 3,   // a wait begins (or a callback time is set); data: ns to the deadline
+    kKindWake = 4,   // the waiter woke (or the callback ran, or a tick); data: lateness in ns
     kKindCost = 5,   // recorded while measuring the log engine's costs
 };
 
@@ -43,9 +57,11 @@ inline uint32_t EventWord(uint32_t series, uint32_t kind) { return (kind << 16) 
 const char* SeriesName(uint32_t id);
 const char* SeriesDescription(uint32_t id);
 
-struct SeriesSamples {
+struct SeriesStats {
     uint32_t id = 0;
-    std::vector<double> latenessUs;
+    qtools::LatencyHistogram histogram;
+    bool measured = true;
+    std::string notMeasured;
     std::size_t failed = 0;
     // Wake-ups more than 1 ms late, and how many of them the survey thread
     // spent mostly runnable but off its CPU (-1: not known for this series).
@@ -59,13 +75,14 @@ struct LogSnapshot {
 };
 
 struct SurveyConfig {
-    int durationS = 10;
+    int64_t durationS = 10;  // 0: until RequestStop
     bool realtime = true;
-    bool progress = false;  // a progress line on stdout (a terminal)
+    int priority = 0;        // 0: just below the library's timer thread
+    std::vector<int> cpus;   // empty: not restricted
 };
 
 struct SurveyResult {
-    std::vector<SeriesSamples> series;  // in SeriesId order
+    std::vector<SeriesStats> series;  // in SeriesId order
     std::size_t tickRestarts = 0;
     std::vector<qtools::CostResult> costs;
     LogSnapshot log;
@@ -73,14 +90,63 @@ struct SurveyResult {
     int priority = 0;
     bool memoryLocked = false;
     bool tickService = true;
+    bool timerRunning = true;
+    bool interrupted = false;
     double surveyedS = 0.0;
     std::vector<std::string> notes;
 };
 
-SurveyResult RunSurvey(const LoadedQuelta& lib, const SurveyConfig& config);
+// Receives every sample, on the thread that calls Poll(): the series, its
+// deadline in seconds since the survey started, and its lateness in us.
+class SampleSink {
+public:
+    virtual ~SampleSink() = default;
+    virtual void OnSample(uint32_t series, double atS, double latenessUs) = 0;
+};
 
-// The describe function for the trace exporter: names the probe's entries.
-qtools::TraceEventInfo DescribeProbeEvent(uint32_t eventWord);
+struct Worker;
+
+class Survey {
+public:
+    Survey(const LoadedQuelta& lib, const SurveyConfig& config);
+    ~Survey();
+    Survey(const Survey&) = delete;
+    Survey& operator=(const Survey&) = delete;
+
+    // Starts the worker; false when no thread could be started.
+    bool Start();
+    void RequestStop();
+    bool Done() const;  // the worker has finished (survey and costs)
+
+    // For the progress line: 0 preparing, 1 surveying, 2 measuring costs.
+    int Phase() const;
+    double ElapsedS() const;  // of the survey proper
+    uint64_t Samples() const;
+
+    // Drains what the worker and the timer thread have handed over.
+    void Poll(SampleSink* sink);
+    // Joins the worker, drains the rest and gives the results.
+    SurveyResult Finish(SampleSink* sink);
+
+private:
+    void ProcessTicks(SampleSink* sink, bool all);
+
+    std::unique_ptr<Worker> worker_;
+    SurveyResult result_;
+    pthread_t thread_{};
+    bool started_ = false;
+    // Main-thread side of the tick: the chunk being collected and the
+    // rebuilt lateness.
+    std::vector<uint64_t> tickChunk_;
+    SeriesStats tick_;
+    double baselineMinUs_ = -1.0;
+    std::string timerThreadNote_;  // what /proc says of the library's timer thread
+};
+
+// The describe function for the trace exporter: names the probe's entries
+// and gives each wait its deadline and lateness; a wake-up later than
+// lateUs gets the name "<series> LATE" and the category "wait,late".
+qtools::TraceDescribeFn ProbeEventDescriber(double lateUs);
 
 }  // namespace qprobe
 
