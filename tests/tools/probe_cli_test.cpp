@@ -187,7 +187,9 @@ TEST_F(ProbeCli, SurveyWritesEveryOutput) {
     for (std::size_t i = 0; i < 7; ++i) {
         const auto it = rows.find(kSeries[i]);
         EXPECT_EQ(it == rows.end() ? 0 : it->second, counts[kSeries[i]]) << kSeries[i];
-        if (i < columns.size()) EXPECT_EQ(columns[i], counts[kSeries[i]]) << kSeries[i];
+        if (i < columns.size()) {
+            EXPECT_EQ(columns[i], counts[kSeries[i]]) << kSeries[i];
+        }
     }
 
     // The trace: every wait a span on the survey's CPU, with its deadline
@@ -205,7 +207,9 @@ TEST_F(ProbeCli, SurveyWritesEveryOutput) {
                     50.0) << e.dump();
         EXPECT_EQ(name.find(" LATE") != std::string::npos, lateness > baseP99) << e.dump();
         late += name.find(" LATE") != std::string::npos;
-        if (name.rfind("callback-time", 0) != 0) EXPECT_EQ(e["tid"], cpu) << e.dump();
+        if (name.rfind("callback-time", 0) != 0) {
+            EXPECT_EQ(e["tid"], cpu) << e.dump();
+        }
     }
     EXPECT_GT(spans, 60);
     EXPECT_LT(late, spans);
