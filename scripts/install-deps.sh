@@ -3,7 +3,8 @@
 set -euo pipefail
 want=(cmake g++ make ninja-build pkg-config googletest libgtest-dev libbenchmark-dev
       g++-arm-linux-gnueabihf libc6-dev-armhf-cross qemu-user util-linux binutils
-      g++-i686-linux-gnu libc6-dev-i386-cross libc6-i386)
+      g++-i686-linux-gnu libc6-dev-i386-cross libc6-i386
+      dpkg-dev file lintian doxygen)
 # Never g++-multilib: on Debian 12 installing it removes the ARM cross compiler.
 missing=()
 for p in "${want[@]}"; do
