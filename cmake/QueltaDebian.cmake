@@ -114,12 +114,6 @@ set(CPACK_DEBIAN_PACKAGE_ARCHITECTURE ${QUELTA_DEB_ARCHITECTURE})
 set(CPACK_DEBIAN_PACKAGE_PRIORITY optional)
 # Control files with the modes Debian prescribes (0644, scripts 0755).
 set(CPACK_DEBIAN_PACKAGE_CONTROL_STRICT_PERMISSION ON)
-# On a multiarch library directory (configured with prefix /usr) the library
-# and its development files are co-installable across architectures.
-if(CMAKE_LIBRARY_ARCHITECTURE AND CMAKE_INSTALL_LIBDIR STREQUAL "lib/${CMAKE_LIBRARY_ARCHITECTURE}")
-  set(CPACK_DEBIAN_RUNTIME_PACKAGE_MULTIARCH same)
-  set(CPACK_DEBIAN_DEVELOPMENT_PACKAGE_MULTIARCH same)
-endif()
 
 # libquelta6. Its shlibs file lets packages built against libquelta depend on
 # libquelta6 (>= this version); its trigger has dpkg run ldconfig once after
