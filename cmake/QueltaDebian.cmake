@@ -115,8 +115,8 @@ set(CPACK_DEBIAN_PACKAGE_PRIORITY optional)
 # Control files with the modes Debian prescribes (0644, scripts 0755).
 set(CPACK_DEBIAN_PACKAGE_CONTROL_STRICT_PERMISSION ON)
 
-# libquelta6. Its shlibs file lets packages built against libquelta depend on
-# libquelta6 (>= this version); its trigger has dpkg run ldconfig once after
+# libquelta6. Its shlibs and symbols files let packages built against
+# libquelta depend on libquelta6 (>= the version they need); its trigger has dpkg run ldconfig once after
 # all packages of a run are unpacked, instead of maintainer scripts (which
 # CPack would add for any package with a shared library in /usr/lib, were it
 # left to compute shlibs and dependencies itself: it is not, see
@@ -126,7 +126,13 @@ set(CPACK_DEBIAN_RUNTIME_PACKAGE_SECTION libs)
 file(WRITE ${QUELTA_DEB_DIR}/shlibs
   "libquelta ${PROJECT_VERSION_MAJOR} ${QUELTA_DEB_RUNTIME} (>= ${PROJECT_VERSION})\n")
 configure_file(${PROJECT_SOURCE_DIR}/cmake/debian/libquelta6.triggers ${QUELTA_DEB_DIR}/triggers COPYONLY)
-set(CPACK_DEBIAN_RUNTIME_PACKAGE_CONTROL_EXTRA "${QUELTA_DEB_DIR}/shlibs;${QUELTA_DEB_DIR}/triggers")
+# The symbols file names every exported symbol with the version that brought
+# it, so that a package built against libquelta depends on the oldest
+# libquelta6 that has what it uses; a new export needs a line there (the
+# packaging test compares it with the library).
+configure_file(${PROJECT_SOURCE_DIR}/cmake/debian/libquelta6.symbols ${QUELTA_DEB_DIR}/symbols COPYONLY)
+set(CPACK_DEBIAN_RUNTIME_PACKAGE_CONTROL_EXTRA
+  "${QUELTA_DEB_DIR}/shlibs;${QUELTA_DEB_DIR}/symbols;${QUELTA_DEB_DIR}/triggers")
 set(CPACK_DEBIAN_RUNTIME_DESCRIPTION "time services for a real-time application runtime
 libquelta.so.6 supplies time to a real-time application runtime: waits on
 the monotonic and the global clock, event waits with timeouts, callbacks

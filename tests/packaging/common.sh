@@ -3,6 +3,9 @@
 # BINDIR MANDIR DATAROOTDIR VERSION DEB_VERSION DEB_ARCH HAS_PROBE CMAKE CPACK
 # CXX GENERATOR MAKE_PROGRAM.
 set -euo pipefail
+# (With pipefail, never `cmd | grep -q`: grep quits at the first match and
+# cmd, killed by SIGPIPE, fails the pipeline. Send grep's output to
+# /dev/null instead.)
 
 for v in BUILD_DIR SOURCE_DIR LIBDIR INCLUDEDIR BINDIR MANDIR DATAROOTDIR VERSION CMAKE CXX; do
   [ -n "${!v:-}" ] || { echo "packaging test: $v not set" >&2; exit 2; }

@@ -26,7 +26,7 @@ contents() {
 depends_on() {
   local depends
   depends=$(field "$2" Depends)
-  if tr ',' '\n' <<<"$depends" | sed 's/^ *//' | grep -Eqx -- "$3"; then
+  if tr ',' '\n' <<<"$depends" | sed 's/^ *//' | grep -Ex -- "$3" >/dev/null; then
     pass "$1"
   else
     fail "$1: Depends is '$depends'"
@@ -59,11 +59,19 @@ if [ "${#debs[@]}" = 3 ]; then
   depends_on "quelta-tools depends on the C++ library (computed)" "$tools_deb" "libstdc\+\+6 $versioned"
 fi
 
-# The runtime package registers its soname and has dpkg run ldconfig through
-# a trigger, with no maintainer scripts of its own.
+# The runtime package registers its soname and symbols and has dpkg run
+# ldconfig through a trigger, with no maintainer scripts of its own.
 dpkg-deb -e "$out/$runtime_deb" "$SCRATCH/control"
 expect_eq "shlibs" "$(cat "$SCRATCH/control/shlibs" 2>/dev/null)" \
   "libquelta $MAJOR libquelta6 (>= $VERSION)"
+# The symbols file lists exactly what the library exports.
+sed -n 's/^ \([^@ ]*\)@Base [0-9].*/\1/p' "$SCRATCH/control/symbols" 2>/dev/null | LC_ALL=C sort >"$SCRATCH/symbols-listed.txt"
+dpkg-deb -x "$out/$runtime_deb" "$SCRATCH/runtime-root"
+readelf --dyn-syms -W "$SCRATCH/runtime-root/usr/$LIBDIR/libquelta.so.$VERSION" \
+  | awk '$7 != "UND" && $7 != "Ndx" && $8 != "" && ($5 == "GLOBAL" || $5 == "WEAK") {print $8}' \
+  | sed 's/@.*//' | LC_ALL=C sort -u >"$SCRATCH/symbols-exported.txt"
+expect_same_list "symbols file lists the library's exports" "$SCRATCH/symbols-listed.txt" "$SCRATCH/symbols-exported.txt"
+expect_eq "symbols file header" "$(head -1 "$SCRATCH/control/symbols" 2>/dev/null)" "libquelta.so.$MAJOR libquelta6 #MINVER#"
 expect_eq "ldconfig trigger" "$(cat "$SCRATCH/control/triggers" 2>/dev/null)" "activate-noawait ldconfig"
 for script in preinst postinst prerm postrm; do
   [ -e "$SCRATCH/control/$script" ] && fail "libquelta6 has a $script script: $(cat "$SCRATCH/control/$script")"
@@ -93,13 +101,13 @@ real="$lib/libquelta.so.$VERSION"
 expect_eq "libquelta.so resolves to the real file" "$(readlink -f "$lib/libquelta.so")" "$(readlink -f "$real")"
 expect_eq "packaged soname" "$(soname_of "$real")" "libquelta.so.$MAJOR"
 expect_eq "packaged library mode" "$(stat -c %a "$real")" "644"
-if readelf -S "$real" | grep -q '\.debug_info'; then
+if readelf -S "$real" | grep '\.debug_info' >/dev/null; then
   fail "packaged library is not stripped"
 else
   pass "packaged library is stripped"
 fi
 # Built with stack canaries (lintian checks the other hardening flags).
-if readelf --dyn-syms -W "$real" | grep -q ' __stack_chk_fail'; then
+if readelf --dyn-syms -W "$real" | grep ' __stack_chk_fail' >/dev/null; then
   pass "packaged library has stack canaries"
 else
   fail "packaged library is built without -fstack-protector-strong"
