@@ -3,7 +3,10 @@
 //   runtime_example [library [cycles]]
 //
 // library: the file to load (default "libquelta.so.6", found like any shared
-// library); cycles: how many 2 ms cycles to run (default 750, 1.5 s).
+// library: through LD_LIBRARY_PATH, the program's run path, then the system's
+// library directories; built in the project's build tree, the example's run
+// path names the library built beside it); cycles: how many 2 ms cycles to
+// run (default 750, 1.5 s).
 //
 // The program does what a runtime does, in the steps the README walks through:
 //  1. load the library with dlopen (loading starts it: no init call);
@@ -22,6 +25,7 @@
 // Exit status: 0 pass; 1 something returned early, failed or never fired;
 // 2 the library could not be loaded; 77 skipped (no real-time privilege).
 #include <dlfcn.h>
+#include <link.h>
 #include <pthread.h>
 #include <sched.h>
 #include <stdint.h>
@@ -156,7 +160,12 @@ int main(int argc, char** argv) {
               Resolve(library, "quelta_iTSC_SetCallback", q.SetCallback) &&
               Resolve(library, "quelta_iTSC_SetCallbackTime", q.SetCallbackTime);
     if (!ok) return 2;
-    printf("loaded %s\n", path);
+    // Which file the search found: a runtime should say, since a stale copy
+    // elsewhere on the search path would be loaded just as silently.
+    struct link_map* loaded = nullptr;
+    const char* file = dlinfo(library, RTLD_DI_LINKMAP, &loaded) == 0 && loaded != nullptr
+                           ? loaded->l_name : "?";
+    printf("loaded %s from %s\n", path, file);
 
     // 3. The two long-lived objects; the library owns them, we borrow them.
     iKPusTimingEngine* engine = q.GetEngine();

@@ -4,9 +4,10 @@ set -euo pipefail
 want=(cmake g++ make ninja-build pkg-config googletest libgtest-dev libbenchmark-dev
       g++-arm-linux-gnueabihf libc6-dev-armhf-cross qemu-user util-linux binutils
       g++-i686-linux-gnu libc6-dev-i386-cross libc6-i386
-      nlohmann-json3-dev libcli11-dev)
-# (The last two are the tools' JSON and command-line libraries; the library
-# itself needs nothing but the C++ standard library.)
+      nlohmann-json3-dev libcli11-dev dpkg-dev file lintian doxygen)
+# (nlohmann-json and CLI11 are the tools' JSON and command-line libraries,
+# dpkg-dev, file and lintian check the packages, doxygen builds the API
+# reference; the library itself needs nothing but the C++ standard library.)
 # Never g++-multilib: on Debian 12 installing it removes the ARM cross compiler.
 missing=()
 for p in "${want[@]}"; do

@@ -1,9 +1,13 @@
 # Shared by the packaging tests. The test's CMake registration passes the
 # build's facts in the environment: BUILD_DIR SOURCE_DIR LIBDIR INCLUDEDIR
-# BINDIR VERSION DEB_ARCH HAS_PROBE CMAKE CPACK CXX GENERATOR MAKE_PROGRAM.
+# BINDIR MANDIR DATAROOTDIR VERSION DEB_VERSION DEB_ARCH HAS_PROBE CMAKE CPACK
+# CXX GENERATOR MAKE_PROGRAM.
 set -euo pipefail
+# (With pipefail, never `cmd | grep -q`: grep quits at the first match and
+# cmd, killed by SIGPIPE, fails the pipeline. Send grep's output to
+# /dev/null instead.)
 
-for v in BUILD_DIR SOURCE_DIR LIBDIR INCLUDEDIR BINDIR VERSION CMAKE CXX; do
+for v in BUILD_DIR SOURCE_DIR LIBDIR INCLUDEDIR BINDIR MANDIR DATAROOTDIR VERSION CMAKE CXX; do
   [ -n "${!v:-}" ] || { echo "packaging test: $v not set" >&2; exit 2; }
 done
 MAJOR=${VERSION%%.*}
@@ -55,6 +59,8 @@ public_headers() {
 # the per-configuration targets file named quelta-targets-CONFIG.cmake.
 expected_development_files() {
   public_headers | sed "s|^|$INCLUDEDIR/|"
+  echo "$INCLUDEDIR/quelta/version.h"
+  echo "$DATAROOTDIR/doc/libquelta-dev/examples/runtime_example.cpp"
   echo "$LIBDIR/libquelta.so"
   echo "$LIBDIR/pkgconfig/quelta.pc"
   echo "$LIBDIR/cmake/quelta/quelta-config.cmake"
@@ -65,6 +71,28 @@ expected_development_files() {
 expected_runtime_files() {
   echo "$LIBDIR/libquelta.so.$MAJOR"
   echo "$LIBDIR/libquelta.so.$VERSION"
+}
+expected_tools_files() {
+  echo "$BINDIR/quelta-probe"
+  echo "$MANDIR/man1/quelta-probe.1.gz"
+}
+# The files Debian wants in every package: /usr/share/doc/<package> and the
+# package's lintian overrides.
+expected_debian_files() {
+  echo "$DATAROOTDIR/doc/$1/changelog.Debian.gz"
+  echo "$DATAROOTDIR/doc/$1/copyright"
+  echo "$DATAROOTDIR/lintian/overrides/$1"
+}
+
+# cpack -G DEB of the build tree into a directory; sets the .deb names.
+runtime_deb="libquelta6_${DEB_VERSION:-}_${DEB_ARCH:-}.deb"
+dev_deb="libquelta-dev_${DEB_VERSION:-}_${DEB_ARCH:-}.deb"
+tools_deb="quelta-tools_${DEB_VERSION:-}_${DEB_ARCH:-}.deb"
+make_debs() {
+  command -v dpkg-deb >/dev/null || { echo "FAIL: dpkg-deb is not installed"; exit 1; }
+  [ -n "${CPACK:-}" ] && [ -n "${DEB_ARCH:-}" ] && [ -n "${DEB_VERSION:-}" ] \
+    || { echo "packaging test: CPACK/DEB_ARCH/DEB_VERSION not set" >&2; exit 2; }
+  run_quiet "$CPACK" -G DEB --config "$BUILD_DIR/CPackConfig.cmake" -B "$1"
 }
 normalise_config() { sed 's|/quelta-targets-[a-z]*\.cmake$|/quelta-targets-CONFIG.cmake|'; }
 

@@ -1,6 +1,7 @@
 # cmake --install lays out a system library: the real file with the full
 # version, the soname and development links, the public headers only,
-# quelta.pc and the CMake package, and nothing else.
+# quelta.pc, the CMake package, the example's source, the probe with its
+# manual page, and nothing else (the Debian files go into packages only).
 source "$(dirname "$0")/common.sh"
 
 prefix="$SCRATCH/prefix"
@@ -12,7 +13,7 @@ lib="$prefix/$LIBDIR"
 {
   expected_runtime_files
   expected_development_files
-  if [ "${HAS_PROBE:-0}" = 1 ]; then echo "$BINDIR/quelta-probe"; echo "share/man/man1/quelta-probe.1.gz"; fi
+  if [ "${HAS_PROBE:-0}" = 1 ]; then expected_tools_files; fi
 } | LC_ALL=C sort >"$SCRATCH/expected.txt"
 tree_of "$prefix" >"$SCRATCH/found.txt"
 expect_same_list "installed tree" "$SCRATCH/found.txt" "$SCRATCH/expected.txt"
@@ -24,7 +25,7 @@ else fail "libquelta.so.$VERSION is not a regular file"; fi
 expect_eq "soname" "$(soname_of "$real")" "libquelta.so.$MAJOR"
 expect_eq "soname link" "$(readlink "$lib/libquelta.so.$MAJOR" || true)" "libquelta.so.$VERSION"
 expect_eq "development link" "$(readlink "$lib/libquelta.so" || true)" "libquelta.so.$MAJOR"
-if readelf -d "$real" | grep -Eq '\((RPATH|RUNPATH)\)'; then
+if readelf -d "$real" | grep -E '\((RPATH|RUNPATH)\)' >/dev/null; then
   fail "installed library keeps a run path: $(readelf -d "$real" | grep -E 'RPATH|RUNPATH')"
 else
   pass "installed library has no run path"
@@ -34,6 +35,9 @@ fi
 while read -r h; do
   cmp -s "$SOURCE_DIR/include/$h" "$prefix/$INCLUDEDIR/$h" || fail "header $h differs from the source"
 done < <(public_headers)
+
+# The generated version header names this version.
+expect_eq "version.h" "$(sed -n 's/^#define QUELTA_VERSION_STRING "\(.*\)"$/\1/p' "$prefix/$INCLUDEDIR/quelta/version.h")" "$VERSION"
 
 # quelta.pc names the prefix it was installed under.
 pc="$lib/pkgconfig/quelta.pc"
