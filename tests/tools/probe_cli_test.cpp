@@ -62,7 +62,7 @@ protected:
         dir_ = tmpl;
     }
     void TearDown() override {
-        if (!dir_.empty()) std::system(("rm -rf '" + dir_ + "'").c_str());
+        if (!dir_.empty()) EXPECT_EQ(std::system(("rm -rf '" + dir_ + "'").c_str()), 0);
     }
 
     // Runs `binary args...` with standard output and error in files; `child`
@@ -389,8 +389,10 @@ TEST_F(ProbeCli, ManualPageAndHelpNameEveryOption) {
               0);
     if (std::system("command -v man >/dev/null 2>&1") == 0) {
         const std::string warn = dir_ + "/man.txt";
-        std::system(("LC_ALL=C.UTF-8 MANROFFSEQ='' MANWIDTH=80 man --warnings -E UTF-8 -l -Tutf8 -Z '" +
-                     std::string(QUELTA_SOURCE_DIR) + "/docs/quelta-probe.1' >/dev/null 2>'" + warn + "'").c_str());
+        EXPECT_EQ(std::system(("LC_ALL=C.UTF-8 MANROFFSEQ='' MANWIDTH=80 man --warnings -E UTF-8 -l -Tutf8 -Z '" +
+                               std::string(QUELTA_SOURCE_DIR) + "/docs/quelta-probe.1' >/dev/null 2>'" + warn + "'")
+                                  .c_str()),
+                  0);
         EXPECT_EQ(ReadFile(warn), "");
     }
 }
