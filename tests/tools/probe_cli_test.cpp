@@ -62,7 +62,9 @@ protected:
         dir_ = tmpl;
     }
     void TearDown() override {
-        if (!dir_.empty()) EXPECT_EQ(std::system(("rm -rf '" + dir_ + "'").c_str()), 0);
+        if (!dir_.empty()) {
+            EXPECT_EQ(std::system(("rm -rf '" + dir_ + "'").c_str()), 0);
+        }
     }
 
     // Runs `binary args...` with standard output and error in files; `child`
