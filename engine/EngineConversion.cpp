@@ -99,6 +99,10 @@ int32_t ConvertClockTime(int32_t fromClock, int32_t toClock, struct timespec* ti
     return StandInConvert(fromClock, toClock, time);
 }
 
+}  // namespace quelta
+
+using namespace quelta;
+
 // clock_getres failing leaves the zeroed timespec: the resolution reads as 0,
 // which no working clock reports, so a caller can tell it is unknown.
 ClockTime tKPusTimingEngine::GetRawClockResolution() {
@@ -156,5 +160,3 @@ ClockTime tKPusTimingEngine::ClocksToMicroseconds64(const ClockTime& ns) {
 uint32_t tKPusTimingEngine::ClocksToMicroseconds32(const uint32_t& ns) {
     return static_cast<uint32_t>((static_cast<uint64_t>(ns) * 0x10624DD3u) >> 38);
 }
-
-}  // namespace quelta

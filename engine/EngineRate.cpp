@@ -52,6 +52,10 @@ double CurrentClockRate() {
     return static_cast<double>(static_cast<int64_t>(w)) / ((p1 * kRateScale) * p2);
 }
 
+}  // namespace quelta
+
+using namespace quelta;
+
 double tKPusTimingEngine::GetClockRate() { return CurrentClockRate() * 1000000.0; }
 
 void tKPusTimingEngine::SetClockRate(double ticksPerSecond) {
@@ -95,5 +99,3 @@ int32_t tKPusTimingEngine::StepGlobalClock(const ClockTime& delta) {
     const timespec target = WidenTimespec(SplitNanoseconds(t));
     return static_cast<int32_t>(gSystemClock.setTime(CLOCK_REALTIME, &target));
 }
-
-}  // namespace quelta

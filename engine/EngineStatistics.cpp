@@ -73,6 +73,10 @@ uint32_t HistogramModeOf(const uint32_t* samples, uint32_t count, uint32_t bucke
 
 uint32_t JitterHistogramMode(const uint32_t* samples) { return HistogramModeOf(samples, kStatsSamples, 10, 10000); }
 
+}  // namespace quelta
+
+using namespace quelta;
+
 uint32_t tKPusTimingEngine::HistogramMode(const uint32_t* samples, uint32_t count, uint32_t bucketWidth,
                                           uint32_t bucketLimit) {
     return HistogramModeOf(samples, count, bucketWidth, bucketLimit);
@@ -148,5 +152,3 @@ uint32_t tKPusTimingEngine::CalibrateWithin(uint32_t timeoutMs) {
     stats.jitterMode.store(mode, std::memory_order_relaxed);
     return mode;
 }
-
-}  // namespace quelta

@@ -15,7 +15,7 @@
 #include "quelta/quelta.h"
 #include "tLinux/PalMemory.h"
 
-namespace quelta {
+using namespace quelta;
 
 namespace {
 
@@ -166,5 +166,3 @@ void tKPusTimingEngine::ReadGlobalWithGeneration(ClockTime& out, uint32_t& gener
 
 void tKPusTimingEngine::RegisterTickCallback(QueltaTickCallbackFn fn) { RegisterTickCallbackImpl(fn); }
 void tKPusTimingEngine::UnregisterTickCallback(QueltaTickCallbackFn fn) { UnregisterTickCallbackImpl(fn); }
-
-}  // namespace quelta

@@ -45,7 +45,7 @@ TEST(EngineKernelClockTest, CurrentRateSetBackReadsTheSameAndAZeroStepKeepsTheTi
     quelta::ResetSystemClockHooks();
     KernelRateGuard guard;
     if (!guard.writable) GTEST_SKIP() << "no permission to set the kernel clock (errno " << guard.writeErrno << ")";
-    std::unique_ptr<iKPusTimingEngine> e(new quelta::tKPusTimingEngine());
+    std::unique_ptr<iKPusTimingEngine> e(new tKPusTimingEngine());
 
     const double rate = e->GetClockRate();
     ASSERT_GT(rate, 0.0);

@@ -13,7 +13,6 @@
 #include "engine_test_helpers.h"
 
 using namespace enginetest;
-using quelta::tKPusTimingEngine;
 
 namespace {
 

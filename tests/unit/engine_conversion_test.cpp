@@ -17,7 +17,6 @@ using namespace enginetest;
 using quelta::ConvertClockTime;
 using quelta::gConvertStandInEnabled;
 using quelta::gConvertSyscallNr;
-using quelta::tKPusTimingEngine;
 
 namespace {
 

@@ -17,7 +17,6 @@
 #include "tLinux/PalMemory.h"
 
 using namespace enginetest;
-using quelta::tKPusTimingEngine;
 
 namespace {
 
