@@ -146,7 +146,9 @@ extern std::atomic<bool> gConvertStandInEnabled;
 
 // Converts the time point in place from one clock to another. 38 (ENOSYS)
 // when no conversion is available; 22 for clock ids other than
-// CLOCK_REALTIME, CLOCK_MONOTONIC and CLOCK_MONOTONIC_RAW.
+// CLOCK_REALTIME, CLOCK_MONOTONIC and CLOCK_MONOTONIC_RAW; 75 (EOVERFLOW)
+// when the kernel call cannot hold the time point and the user-space
+// conversion is switched off.
 int32_t ConvertClockTime(int32_t fromClock, int32_t toClock, struct timespec* time);
 
 }  // namespace quelta
