@@ -126,7 +126,9 @@ public:
     static void* operator new(size_t bytes) noexcept;
     static void operator delete(void* p) noexcept;
 
-    // Fields, in order. Shared words are relaxed atomics.
+    // Fields, in order. Shared words are relaxed atomics, except statsCount:
+    // the tick service stores it with release after writing the sample it
+    // counts, and Calibrate loads it with acquire.
     std::atomic<uint32_t> statsEnabled;
     std::atomic<int32_t> statsCount;
     quelta::StatisticsBlock stats;

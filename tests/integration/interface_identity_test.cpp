@@ -1,10 +1,12 @@
 // What the runtime sees of the loaded libquelta.so.6 besides its calls: every
 // virtual slot of both objects is an entry point of its own (also where two
 // slots behave the same), the objects' run-time types carry their plain
-// names, and the library carries no path of the machine that built it.
+// names, the library carries no path of the machine that built it, and the
+// shared semaphore record does not depend on the width of time_t.
 #include <dlfcn.h>
 #include <gtest/gtest.h>
 
+#include <cstddef>
 #include <cstdio>
 #include <cstring>
 #include <cxxabi.h>
@@ -17,6 +19,8 @@
 #include <vector>
 
 #include "LoadedLibrary.h"
+#include "Time32Layout.h"
+#include "quelta/PalSemaphore.h"
 
 using testsupport::LoadedLibrary;
 
@@ -111,6 +115,19 @@ TEST_F(InterfaceIdentity, DiagnosticNamesItsSourceRelativeToTheProject) {
     const std::string path = m[1];
     EXPECT_NE(path[0], '/') << path;
     EXPECT_TRUE(std::ifstream(std::string(QUELTA_SOURCE_DIR) + "/" + path).good()) << path;
+}
+
+// The library uses 64-bit time on every target; a runtime built with the C
+// library's default (32-bit time_t on a 32-bit target) shares PalSemaphore
+// with it unchanged. Nothing else of the interface carries a time type.
+TEST(InterfaceLayout, PalSemaphoreDoesNotDependOnTheWidthOfTime) {
+    const testsupport::RecordLayout runtime = testsupport::PalSemaphoreLayoutWith32BitTime();
+    EXPECT_EQ(sizeof(time_t), 8u);
+    EXPECT_EQ(runtime.timeTSize, sizeof(void*) == 4 ? 4u : 8u) << "the runtime's side is not default time";
+    EXPECT_EQ(runtime.size, sizeof(PalSemaphore));
+    EXPECT_EQ(runtime.mutexOffset, offsetof(PalSemaphore, mutex));
+    EXPECT_EQ(runtime.countOffset, offsetof(PalSemaphore, count));
+    EXPECT_EQ(runtime.waitersOffset, offsetof(PalSemaphore, waiters));
 }
 
 }  // namespace

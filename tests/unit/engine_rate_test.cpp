@@ -8,6 +8,7 @@
 #include <atomic>
 #include <chrono>
 #include <cmath>
+#include <cstdlib>
 #include <limits>
 #include <string>
 #include <thread>
@@ -115,6 +116,36 @@ TEST_F(EngineRateTest, GetClockRateRebuildsTheRateWord) {
     gFake.readTick = 10000;
     gFake.readFreq = 0;
     EXPECT_EQ(quelta::CurrentClockRate(), 1e-4) << "in ticks per microsecond";
+}
+
+// The kernel clock's current rate, read and set back, is kept: within one
+// freq unit (2^-16 of a tick), as the round trip through double allows, and
+// reads back as the same rate. (A zero step keeps the time: first case of
+// the step test below.)
+TEST_F(EngineRateTest, CurrentRateSetBackIsKept) {
+    struct timex host {};
+    adjtimex(&host);  // modes 0: reads the machine's values, changes nothing
+    const struct {
+        long tick, freq;
+    } cases[] = {
+        {10000, 0}, {10000, 1234567}, {9999, -2000000}, {10001, 32768000}, {10000, -32768000}, {9000, 1},
+        {static_cast<long>(host.tick), static_cast<long>(host.freq)},
+    };
+    quelta::KernelTickRate();  // announced here, not in the loop
+    for (const auto& c : cases) {
+        SCOPED_TRACE(testing::Message() << c.tick << "/" << c.freq);
+        gFake.readTick = c.tick;
+        gFake.readFreq = c.freq;
+        const double rate = e->GetClockRate();
+        SetRate(rate);
+        ASSERT_EQ(output, "");
+        const int64_t before = int64_t(c.tick) * 65536 + c.freq;
+        const int64_t after = int64_t(gFake.lastSet.tick) * 65536 + gFake.lastSet.freq;
+        EXPECT_LE(std::llabs(after - before), 1);
+        gFake.readTick = gFake.lastSet.tick;
+        gFake.readFreq = gFake.lastSet.freq;
+        EXPECT_NEAR(e->GetClockRate(), rate, rate * 1e-8);
+    }
 }
 
 TEST_F(EngineRateTest, StepGlobalClockAddsASignedDeltaIn64BitSeconds) {
