@@ -11,7 +11,6 @@
 
 namespace {
 
-using quelta::tKPusTimingEngine;
 
 // Opaque to the optimiser, so every call below stays a virtual call.
 iKPusTimingEngine* volatile gBenchEngine = nullptr;

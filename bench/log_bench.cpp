@@ -25,7 +25,6 @@
 namespace {
 
 using quelta::tKPLogEngine;
-using quelta::tKPusTimingEngine;
 
 // Opaque to the optimiser, so every call below stays a virtual call. Built
 // before main, so that threaded runs never race on its creation.

@@ -25,5 +25,7 @@ file(MAKE_DIRECTORY "${QUELTA_I686_RUNTIME_DIR}")
 foreach(lib libstdc++.so.6 libgcc_s.so.1)
   file(CREATE_LINK "/usr/i686-linux-gnu/lib/${lib}" "${QUELTA_I686_RUNTIME_DIR}/${lib}" SYMBOLIC)
 endforeach()
+# The library finds them relative to itself, so that it carries no path of
+# the build machine (it lies beside that directory in the build tree).
 set(CMAKE_EXE_LINKER_FLAGS_INIT "-Wl,-rpath,${QUELTA_I686_RUNTIME_DIR}")
-set(CMAKE_SHARED_LINKER_FLAGS_INIT "-Wl,-rpath,${QUELTA_I686_RUNTIME_DIR}")
+set(CMAKE_SHARED_LINKER_FLAGS_INIT "-Wl,-rpath,'$ORIGIN/i686-runtime'")

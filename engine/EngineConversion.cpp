@@ -1,11 +1,10 @@
 // Conversion between the monotonic and the global time base, the raw clock's
 // resolution, and the unit slots (clocks <-> microseconds).
 #include <errno.h>
-#include <sys/syscall.h>
 #include <time.h>
-#include <unistd.h>
 
-#include "engine/EngineDetail.h"
+#include <limits>
+
 #include "engine/U64Arith.h"
 #include "engine/tKPusTimingEngine.h"
 
@@ -31,9 +30,9 @@ bool IsKnownClock(int32_t id) {
 
 // Writes a nanosecond count back as a kernel would: a time before the clock's
 // zero (top bit set, read as signed) gets negative seconds and nanoseconds in
-// [0, 1e9); otherwise this is the library's ordinary split. Seconds keep only
-// their low 32 bits either way.
-Timespec32 SplitSigned(uint64_t ns) {
+// [0, 1e9); otherwise this is the library's ordinary split. Either way
+// JoinNanoseconds gives the count back.
+timespec SplitSigned(uint64_t ns) {
     const int64_t v = static_cast<int64_t>(ns);
     if (v >= 0) return SplitNanoseconds(ns);
     int64_t q = v / kNsPerSecondSigned;
@@ -42,16 +41,16 @@ Timespec32 SplitSigned(uint64_t ns) {
         r += kNsPerSecondSigned;
         q -= 1;
     }
-    Timespec32 t;
-    t.sec = static_cast<int32_t>(static_cast<uint32_t>(static_cast<uint64_t>(q)));
-    t.nsec = static_cast<int32_t>(r);
+    timespec t{};
+    t.tv_sec = static_cast<time_t>(q);
+    t.tv_nsec = static_cast<long>(r);
     return t;
 }
 
 inline bool ReadNs(int32_t clock, uint64_t& ns) {
     timespec ts{};
     if (gSystemClock.getTime(static_cast<clockid_t>(clock), &ts) != 0) return false;
-    ns = JoinNanoseconds(NarrowTimespec(ts));
+    ns = JoinNanoseconds(ts);
     return true;
 }
 
@@ -81,9 +80,28 @@ int32_t StandInConvert(int32_t fromClock, int32_t toClock, timespec* time) {
         if (span <= kTightBracketNs) break;
     }
     if (!found) return EINVAL;  // no clock could be read: the time point stays as it was
-    const uint64_t point = JoinNanoseconds(NarrowTimespec(*time));
-    *time = WidenTimespec(SplitSigned(point + bestOffset));
+    const uint64_t point = JoinNanoseconds(*time);
+    *time = SplitSigned(point + bestOffset);
     return 0;
+}
+
+// The kernel's conversion call takes the kernel's own time point, whose
+// seconds are as wide as its long. A time point whose seconds do not fit (a
+// wall-clock time past 2038-01-19 on a 32-bit target), or a result the call
+// reports it cannot represent (EOVERFLOW), is left to the user-space
+// conversion: returns false then, with the time point untouched. Any other
+// result of the call is passed back, the time point as the call left it.
+bool KernelConvert(int32_t nr, int32_t fromClock, int32_t toClock, timespec* time, int32_t& result) {
+    constexpr long kLongMax = std::numeric_limits<long>::max();
+    constexpr long kLongMin = std::numeric_limits<long>::min();
+    if (time->tv_sec > kLongMax || time->tv_sec < kLongMin) return false;
+    KernelTimespec k{static_cast<long>(time->tv_sec), time->tv_nsec};
+    const long r = gSystemClock.convertTime(nr, fromClock, toClock, &k);
+    if (r == -1 && errno == EOVERFLOW) return false;
+    time->tv_sec = static_cast<time_t>(k.tv_sec);
+    time->tv_nsec = k.tv_nsec;
+    result = static_cast<int32_t>(r);
+    return true;
 }
 
 }  // namespace
@@ -91,38 +109,46 @@ int32_t StandInConvert(int32_t fromClock, int32_t toClock, timespec* time) {
 int32_t ConvertClockTime(int32_t fromClock, int32_t toClock, struct timespec* time) {
     const int32_t nr = gConvertSyscallNr.load(std::memory_order_relaxed);
     if (nr >= 1) {
-        return static_cast<int32_t>(syscall(static_cast<long>(nr), static_cast<long>(fromClock),
-                                            static_cast<long>(toClock), time));
+        int32_t result = 0;
+        if (KernelConvert(nr, fromClock, toClock, time, result)) return result;
+        if (!gConvertStandInEnabled.load(std::memory_order_relaxed)) return EOVERFLOW;
+    } else if (!gConvertStandInEnabled.load(std::memory_order_relaxed)) {
+        return ENOSYS;
     }
-    if (!gConvertStandInEnabled.load(std::memory_order_relaxed)) return ENOSYS;
     if (!IsKnownClock(fromClock) || !IsKnownClock(toClock)) return EINVAL;
     return StandInConvert(fromClock, toClock, time);
 }
+
+}  // namespace quelta
+
+using namespace quelta;
 
 // clock_getres failing leaves the zeroed timespec: the resolution reads as 0,
 // which no working clock reports, so a caller can tell it is unknown.
 ClockTime tKPusTimingEngine::GetRawClockResolution() {
     timespec ts{};
     gSystemClock.getRes(CLOCK_MONOTONIC_RAW, &ts);
-    return FromU64(JoinNanoseconds(NarrowTimespec(ts)));
+    return FromU64(JoinNanoseconds(ts));
 }
 
+// Both directions keep the wall-clock seconds in 64 bits: the conversion
+// goes on past 2038-01-19 on every target, and gives the results of the
+// kernel's 32-bit fields wherever the seconds fit in 31 bits.
 ClockTime tKPusTimingEngine::GlobalToMonotonicImpl(const ClockTime& g) {
     const int64_t offset = epochOffset.load(std::memory_order_relaxed);
     const uint64_t t = ToU64(g) - static_cast<uint64_t>(offset) * kNsPerSecond;
-    timespec ts = WidenTimespec(SplitNanoseconds(t));
+    timespec ts = SplitNanoseconds(t);
     ConvertClockTime(CLOCK_REALTIME, CLOCK_MONOTONIC, &ts);  // a failure leaves ts as it was
-    return FromU64(JoinNanoseconds(NarrowTimespec(ts)));
+    return FromU64(JoinNanoseconds(ts));
 }
 
 ClockTime tKPusTimingEngine::MonotonicToGlobalImpl(const ClockTime& m) {
-    timespec ts = WidenTimespec(SplitNanoseconds(ToU64(m)));
+    timespec ts = SplitNanoseconds(ToU64(m));
     ConvertClockTime(CLOCK_MONOTONIC, CLOCK_REALTIME, &ts);  // a failure leaves ts as it was
-    const Timespec32 t = NarrowTimespec(ts);
     const int64_t offset = epochOffset.load(std::memory_order_relaxed);
     // The offset joins the seconds before the product, both sign-extended.
-    const uint64_t seconds = static_cast<uint64_t>(static_cast<int64_t>(t.sec)) + static_cast<uint64_t>(offset);
-    return FromU64(seconds * kNsPerSecond + static_cast<uint64_t>(static_cast<int64_t>(t.nsec)));
+    const uint64_t seconds = static_cast<uint64_t>(static_cast<int64_t>(ts.tv_sec)) + static_cast<uint64_t>(offset);
+    return FromU64(seconds * kNsPerSecond + static_cast<uint64_t>(static_cast<int64_t>(ts.tv_nsec)));
 }
 
 // --- units ---------------------------------------------------------------------
@@ -156,5 +182,3 @@ ClockTime tKPusTimingEngine::ClocksToMicroseconds64(const ClockTime& ns) {
 uint32_t tKPusTimingEngine::ClocksToMicroseconds32(const uint32_t& ns) {
     return static_cast<uint32_t>((static_cast<uint64_t>(ns) * 0x10624DD3u) >> 38);
 }
-
-}  // namespace quelta

@@ -52,6 +52,10 @@ double CurrentClockRate() {
     return static_cast<double>(static_cast<int64_t>(w)) / ((p1 * kRateScale) * p2);
 }
 
+}  // namespace quelta
+
+using namespace quelta;
+
 double tKPusTimingEngine::GetClockRate() { return CurrentClockRate() * 1000000.0; }
 
 void tKPusTimingEngine::SetClockRate(double ticksPerSecond) {
@@ -84,16 +88,14 @@ void tKPusTimingEngine::SetClockRateMHz(double ticksPerMicrosecond) {
 }
 
 // Steps CLOCK_REALTIME by a signed delta (a delta with the top bit set steps
-// back). The epoch offset plays no part: the global clock follows because it
-// is derived from CLOCK_REALTIME. If the clock cannot even be read, nothing
+// back), in 64-bit seconds on every target. The epoch offset plays no part:
+// the global clock follows because it is derived from CLOCK_REALTIME. If the clock cannot even be read, nothing
 // is set and -1 is returned (errno from clock_gettime): setting the clock to
 // "zero plus delta" instead would throw the machine's clock back to 1970.
 int32_t tKPusTimingEngine::StepGlobalClock(const ClockTime& delta) {
     timespec now{};
     if (gSystemClock.getTime(CLOCK_REALTIME, &now) != 0) return -1;
-    const uint64_t t = JoinNanoseconds(NarrowTimespec(now)) + ToU64(delta);
-    const timespec target = WidenTimespec(SplitNanoseconds(t));
+    const uint64_t t = JoinNanoseconds(now) + ToU64(delta);
+    const timespec target = SplitNanoseconds(t);
     return static_cast<int32_t>(gSystemClock.setTime(CLOCK_REALTIME, &target));
 }
-
-}  // namespace quelta

@@ -61,8 +61,10 @@ uint32_t HistogramModeOf(const uint32_t* samples, uint32_t count, uint32_t bucke
         // zero sample (0/0) to bucket 0, so the result is 0 either way.
         const uint32_t b = SaturateToU32(static_cast<double>(samples[i]) / static_cast<double>(bucketWidth) + 0.5);
         if (b < limit) {
-            // Strictly greater: a tie stays with the bucket that got there first.
-            if (++counters[b] > counters[mode]) mode = b;
+            // Strictly greater: a tie stays with the bucket that got there
+            // first, and the mode's own bucket never beats itself.
+            const uint32_t n = ++counters[b];
+            if (n > counters[mode]) mode = b;
         }
     }
     PalMemFree(counters);
@@ -72,6 +74,10 @@ uint32_t HistogramModeOf(const uint32_t* samples, uint32_t count, uint32_t bucke
 }
 
 uint32_t JitterHistogramMode(const uint32_t* samples) { return HistogramModeOf(samples, kStatsSamples, 10, 10000); }
+
+}  // namespace quelta
+
+using namespace quelta;
 
 uint32_t tKPusTimingEngine::HistogramMode(const uint32_t* samples, uint32_t count, uint32_t bucketWidth,
                                           uint32_t bucketLimit) {
@@ -116,7 +122,9 @@ uint32_t tKPusTimingEngine::CalibrateWithin(uint32_t timeoutMs) {
     int32_t lastCount = 0;
     uint64_t lastAdvanceMs = MonotonicMs();
     for (;;) {
-        const int32_t n = statsCount.load(std::memory_order_relaxed);
+        // Acquire pairs with the tick service's release of the count: the
+        // samples it counts are visible once the count is.
+        const int32_t n = statsCount.load(std::memory_order_acquire);
         if (n >= static_cast<int32_t>(kStatsSamples)) break;
         if (timeoutMs != 0) {
             const uint64_t nowMs = MonotonicMs();
@@ -148,5 +156,3 @@ uint32_t tKPusTimingEngine::CalibrateWithin(uint32_t timeoutMs) {
     stats.jitterMode.store(mode, std::memory_order_relaxed);
     return mode;
 }
-
-}  // namespace quelta

@@ -1,10 +1,8 @@
 // The global clock's epoch offset: seconds from 1904-01-01 00:00:00 to
 // 1970-01-01 00:00:00 in the local zone, from two mktime calls.
 //
-// 1904 lies before the range of a 32-bit time_t, so this one file asks the C
-// library for its 64-bit time functions on 32-bit targets.
-#define _FILE_OFFSET_BITS 64
-#define _TIME_BITS 64
+// 1904 lies before the range of a 32-bit time_t: like the whole library, this
+// uses the C library's 64-bit time functions on 32-bit targets too.
 #include <time.h>
 
 #include <cstdint>

@@ -9,9 +9,10 @@
 #include <atomic>
 #include <cstdint>
 
+class tKPusTimingEngine;
+
 namespace quelta {
 
-class tKPusTimingEngine;
 class tKPusLinuxNanoSleepTimer;
 class tKPLogEngine;
 

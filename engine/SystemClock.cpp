@@ -1,7 +1,8 @@
-// The kernel clock calls of the engine, and the library's 32-bit view of a
-// kernel time point.
+// The kernel clock calls of the engine, and the splitting and joining of
+// nanosecond counts.
 #include "engine/SystemClock.h"
 
+#include <sys/syscall.h>
 #include <sys/timex.h>
 #include <time.h>
 #include <unistd.h>
@@ -14,6 +15,10 @@ constexpr uint64_t kNsPerSecond = 1000000000ull;
 
 long RealClockTicksPerSecond() { return sysconf(_SC_CLK_TCK); }
 
+long RealConvertTime(long number, int32_t fromClock, int32_t toClock, KernelTimespec* time) {
+    return syscall(number, static_cast<long>(fromClock), static_cast<long>(toClock), time);
+}
+
 // The real calls are taken by address, so a production read costs one
 // indirect call and no wrapper.
 constexpr SystemClockHooks kRealHooks = {
@@ -22,6 +27,7 @@ constexpr SystemClockHooks kRealHooks = {
     &::clock_settime,
     &::adjtimex,
     &RealClockTicksPerSecond,
+    &RealConvertTime,
 };
 
 }  // namespace
@@ -30,21 +36,19 @@ SystemClockHooks gSystemClock = kRealHooks;
 
 void ResetSystemClockHooks() { gSystemClock = kRealHooks; }
 
-Timespec32 SplitNanoseconds(uint64_t ns) {
+timespec SplitNanoseconds(uint64_t ns) {
     const uint64_t seconds = ns / kNsPerSecond;
-    Timespec32 ts;
-    // Only the low 32 bits of the seconds survive (inputs from about 136
-    // years on wrap), the same on a 64-bit build as on the 32-bit target.
-    ts.sec = static_cast<int32_t>(static_cast<uint32_t>(seconds));
-    ts.nsec = static_cast<int32_t>(ns - seconds * kNsPerSecond);
+    timespec ts{};
+    ts.tv_sec = static_cast<time_t>(seconds);  // below 2^35: fits a 64-bit time_t
+    ts.tv_nsec = static_cast<long>(ns - seconds * kNsPerSecond);
     return ts;
 }
 
-uint64_t JoinNanoseconds(const Timespec32& ts) {
-    // Unsigned arithmetic on the sign-extended words: two's-complement
+uint64_t JoinNanoseconds(const timespec& ts) {
+    // Unsigned arithmetic on the sign-extended fields: two's-complement
     // wrap-around without signed overflow.
-    return static_cast<uint64_t>(static_cast<int64_t>(ts.sec)) * kNsPerSecond +
-           static_cast<uint64_t>(static_cast<int64_t>(ts.nsec));
+    return static_cast<uint64_t>(static_cast<int64_t>(ts.tv_sec)) * kNsPerSecond +
+           static_cast<uint64_t>(static_cast<int64_t>(ts.tv_nsec));
 }
 
 }  // namespace quelta

@@ -15,12 +15,22 @@
 
 namespace quelta {
 
+// The layout the kernel's clock calls of the old interface use: seconds and
+// nanoseconds as wide as the kernel's long, so 32-bit seconds on a 32-bit
+// target. Only the clock conversion call of the kernel extension takes it.
+struct KernelTimespec {
+    long tv_sec;
+    long tv_nsec;
+};
+
 struct SystemClockHooks {
     int (*getTime)(clockid_t, struct timespec*);
     int (*getRes)(clockid_t, struct timespec*);
     int (*setTime)(clockid_t, const struct timespec*);
     int (*adjustTime)(struct timex*);
     long (*clockTicksPerSecond)();  // sysconf(_SC_CLK_TCK)
+    // The kernel's clock conversion call: syscall(number, from, to, time).
+    long (*convertTime)(long number, int32_t fromClock, int32_t toClock, KernelTimespec* time);
 };
 
 extern SystemClockHooks gSystemClock;
@@ -28,17 +38,17 @@ extern SystemClockHooks gSystemClock;
 // Restores the real calls.
 void ResetSystemClockHooks();
 
-// A kernel time point as the library treats it: 32-bit signed seconds and
-// nanoseconds on every target.
-struct Timespec32 {
-    int32_t sec;
-    int32_t nsec;
-};
+// Wall-clock seconds are 64-bit on every target (32-bit targets build with
+// the C library's 64-bit time interfaces), so the global clock goes on past
+// 2038-01-19 there too. Wherever the seconds fit in 31 bits the results are
+// those of the kernel's 32-bit fields.
+static_assert(sizeof(time_t) == 8, "32-bit targets build with _TIME_BITS=64");
 
-// Splitting: unsigned division by 1e9; seconds = low 32 bits of the quotient.
-Timespec32 SplitNanoseconds(uint64_t ns);
-// Joining: sec * 1e9 + nsec, both sign-extended from 32 bits, 64-bit wrap.
-uint64_t JoinNanoseconds(const Timespec32& ts);
+// Splitting: unsigned division by 1e9; the seconds are the whole quotient.
+timespec SplitNanoseconds(uint64_t ns);
+// Joining: sec * 1e9 + nsec in 64-bit arithmetic, wrapping modulo 2^64, so
+// that JoinNanoseconds(SplitNanoseconds(n)) == n for every n.
+uint64_t JoinNanoseconds(const timespec& ts);
 
 }  // namespace quelta
 

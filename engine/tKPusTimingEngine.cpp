@@ -8,14 +8,13 @@
 #include <time.h>
 
 #include "engine/ClockWaits.h"
-#include "engine/EngineDetail.h"
 #include "engine/SchedulerState.h"
 #include "engine/TimerArming.h"
 #include "engine/WaitList.h"
 #include "quelta/quelta.h"
 #include "tLinux/PalMemory.h"
 
-namespace quelta {
+using namespace quelta;
 
 namespace {
 
@@ -70,12 +69,13 @@ void tKPusTimingEngine::ReadClock(ClockTime& out, uint32_t selector) {
         out = c.cell != nullptr ? c.cell->LoadTime() : ClockTime{0, 0};
         return;
     }
-    const Timespec32 t = NarrowTimespec(ts);
     const int64_t offset = c.global ? epochOffset.load(std::memory_order_relaxed) : 0;
-    // (offset + sec) * 1e9 + nsec, each sign-extended, wrapping like the
-    // 32-bit target's 64-bit arithmetic.
-    const uint64_t seconds = static_cast<uint64_t>(offset) + static_cast<uint64_t>(static_cast<int64_t>(t.sec));
-    const uint64_t value = seconds * kNsPerSecond + static_cast<uint64_t>(static_cast<int64_t>(t.nsec));
+    // (offset + sec) * 1e9 + nsec in 64-bit arithmetic, wrapping modulo 2^64.
+    // The seconds are the kernel's full 64-bit count, so the global clock
+    // goes on past 2038 on every target; the 64-bit nanosecond value since
+    // 1904 itself runs until the year 2488.
+    const uint64_t seconds = static_cast<uint64_t>(offset) + static_cast<uint64_t>(static_cast<int64_t>(ts.tv_sec));
+    const uint64_t value = seconds * kNsPerSecond + static_cast<uint64_t>(static_cast<int64_t>(ts.tv_nsec));
     out = FromU64(value);
     if (c.cell != nullptr) c.cell->Store(value);
 }
@@ -166,5 +166,3 @@ void tKPusTimingEngine::ReadGlobalWithGeneration(ClockTime& out, uint32_t& gener
 
 void tKPusTimingEngine::RegisterTickCallback(QueltaTickCallbackFn fn) { RegisterTickCallbackImpl(fn); }
 void tKPusTimingEngine::UnregisterTickCallback(QueltaTickCallbackFn fn) { UnregisterTickCallbackImpl(fn); }
-
-}  // namespace quelta

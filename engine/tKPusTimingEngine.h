@@ -1,5 +1,10 @@
 // tKPusTimingEngine: the implementation of the timing engine (57 slots: the
 // 56 of the interface plus SetClockRateMHz).
+//
+// The class lives in the global namespace beside its interface, so that its
+// run-time type is named plainly "tKPusTimingEngine" for a runtime that asks
+// typeid. Its helpers stay in namespace quelta; the class stays hidden from
+// the shared library's symbol table like everything else of the library.
 #ifndef QUELTA_ENGINE_TKPUSTIMINGENGINE_H
 #define QUELTA_ENGINE_TKPUSTIMINGENGINE_H
 
@@ -29,6 +34,16 @@ struct StatisticsBlock {
     std::atomic<uint32_t> rawReadSamples[kStatsSamples];
     std::atomic<uint32_t> globalReadSamples[kStatsSamples];
 };
+
+static_assert(sizeof(StatisticsBlock) == 12016, "statistics record is 12016 bytes");
+static_assert(offsetof(StatisticsBlock, jitterMode) == 4, "layout");
+static_assert(offsetof(StatisticsBlock, rawReadCost) == 8, "layout");
+static_assert(offsetof(StatisticsBlock, globalReadExtra) == 12, "layout");
+static_assert(offsetof(StatisticsBlock, jitterSamples) == 16, "layout");
+static_assert(offsetof(StatisticsBlock, rawReadSamples) == 4016, "layout");
+static_assert(offsetof(StatisticsBlock, globalReadSamples) == 8016, "layout");
+
+}  // namespace quelta
 
 class tKPusTimingEngine : public iKPusTimingEngine {
 public:
@@ -111,23 +126,19 @@ public:
     static void* operator new(size_t bytes) noexcept;
     static void operator delete(void* p) noexcept;
 
-    // Fields, in order. Shared words are relaxed atomics.
+    // Fields, in order. Shared words are relaxed atomics, except statsCount:
+    // the tick service stores it with release after writing the sample it
+    // counts, and Calibrate loads it with acquire.
     std::atomic<uint32_t> statsEnabled;
     std::atomic<int32_t> statsCount;
-    StatisticsBlock stats;
+    quelta::StatisticsBlock stats;
     std::atomic<uint32_t> serviceMode;
     std::atomic<int32_t> epochOffset;
-    alignas(8) AtomicClockTime lastMonotonic;
-    alignas(8) AtomicClockTime lastGlobal;
+    alignas(8) quelta::AtomicClockTime lastMonotonic;
+    alignas(8) quelta::AtomicClockTime lastGlobal;
 };
 
-static_assert(sizeof(StatisticsBlock) == 12016, "statistics record is 12016 bytes");
-static_assert(offsetof(StatisticsBlock, jitterMode) == 4, "layout");
-static_assert(offsetof(StatisticsBlock, rawReadCost) == 8, "layout");
-static_assert(offsetof(StatisticsBlock, globalReadExtra) == 12, "layout");
-static_assert(offsetof(StatisticsBlock, jitterSamples) == 16, "layout");
-static_assert(offsetof(StatisticsBlock, rawReadSamples) == 4016, "layout");
-static_assert(offsetof(StatisticsBlock, globalReadSamples) == 8016, "layout");
+namespace quelta {
 
 // Clock conversion system call: 0 not read, -1 unavailable.
 extern std::atomic<int32_t> gConvertSyscallNr;
@@ -137,7 +148,9 @@ extern std::atomic<bool> gConvertStandInEnabled;
 
 // Converts the time point in place from one clock to another. 38 (ENOSYS)
 // when no conversion is available; 22 for clock ids other than
-// CLOCK_REALTIME, CLOCK_MONOTONIC and CLOCK_MONOTONIC_RAW.
+// CLOCK_REALTIME, CLOCK_MONOTONIC and CLOCK_MONOTONIC_RAW; 75 (EOVERFLOW)
+// when the kernel call cannot hold the time point and the user-space
+// conversion is switched off.
 int32_t ConvertClockTime(int32_t fromClock, int32_t toClock, struct timespec* time);
 
 }  // namespace quelta

@@ -1,5 +1,5 @@
 // The timing engine's clock reads and units. Reads on a fake kernel clock:
-// the epoch offset, the 32-bit view of the kernel's fields, what a failed read
+// the epoch offset, the kernel's 64-bit seconds, what a failed read
 // yields, the last-read cells under concurrent readers (which clock each slot
 // reads is checked by slot position in the vtable test). Units: slot 21
 // against its defining formula evaluated in full 128-bit arithmetic, slot 22
@@ -13,7 +13,6 @@
 #include "engine_test_helpers.h"
 
 using namespace enginetest;
-using quelta::tKPusTimingEngine;
 
 namespace {
 
@@ -71,32 +70,42 @@ TEST_F(EngineClockTest, FreshEngineReadsZeroEverywhere) {
     for (uint32_t w : block) ASSERT_EQ(w, 0u);
 }
 
-TEST_F(EngineClockTest, ExactArithmeticWithTheOffsetAnd32BitKernelFields) {
+// The results are (offset + sec) * 1e9 + nsec with the kernel's 64-bit
+// seconds; wherever the seconds fit in 31 bits that is bit for bit the
+// formula on 32-bit kernel fields, sign-extended.
+uint64_t Formula32(int32_t offset, int32_t sec, int32_t nsec) {
+    return (static_cast<uint64_t>(static_cast<int64_t>(offset)) + static_cast<uint64_t>(static_cast<int64_t>(sec))) *
+               kNs +
+           static_cast<uint64_t>(static_cast<int64_t>(nsec));
+}
+
+TEST_F(EngineClockTest, ExactArithmeticWithTheOffsetAnd64BitSeconds) {
     UseFakeClock();
-    const bool wideTime = sizeof(time_t) > 4;
     const struct {
         timespec kernel;
         int32_t offset;
         uint64_t want;
     } global[] = {
-        {Ts(1700000000, 123456789), kEpoch1904, 1700000000123456789ull + 2082844800000000000ull},
-        {Ts(1700000000, 123456789), -1000, (1700000000u - 1000u) * kNs + 123456789u},
-        {Ts(5, 250), -10, uint64_t(0) - 5 * kNs + 250},  // before the clock's zero: wraps
+        {Ts(1700000000, 123456789), kEpoch1904, Formula32(kEpoch1904, 1700000000, 123456789)},
+        {Ts(1700000000, 123456789), -1000, Formula32(-1000, 1700000000, 123456789)},
+        {Ts(5, 250), -10, Formula32(-10, 5, 250)},  // before the clock's zero: wraps
+        {Ts(0x7FFFFFFF, 999999999), kEpoch1904, Formula32(kEpoch1904, 0x7FFFFFFF, 999999999)},
+        // Past 2038-01-19 the seconds go on instead of turning negative.
+        {Ts(0x80000000ll, 0), kEpoch1904, (0x80000000ull + 2082844800u) * kNs},
+        {Ts(4102444800ll, 5), kEpoch1904, (4102444800ull + 2082844800u) * kNs + 5},  // 2100
     };
     for (const auto& c : global) {
         gFake.realtime = c.kernel;
         engine->SetEpochOffset(c.offset);
-        EXPECT_EQ(Read(&iKPusTimingEngine::ReadGlobal6), c.want) << c.offset;
+        EXPECT_EQ(Read(&iKPusTimingEngine::ReadGlobal6), c.want) << c.offset << " " << c.kernel.tv_sec;
     }
     const struct {
         timespec kernel;
         uint64_t want;
     } monotonic[] = {
         {Ts(86400, 5), 86400 * kNs + 5},
-        // Seconds with bit 31 set are negative, on a 64-bit time_t as on the target...
-        {Ts(wideTime ? 0x80000000ll : INT32_MIN, 0), uint64_t(0) - 2147483648ull * kNs},
-        // ...and bits above 32 of a 64-bit tv_sec are dropped.
-        {Ts(wideTime ? 0x100000005ll : 5, 7), 5 * kNs + 7},
+        {Ts(0x80000000ll, 0), 2147483648ull * kNs},
+        {Ts(0x100000005ll, 7), 0x100000005ull * kNs + 7},
     };
     for (const auto& c : monotonic) {
         gFake.monotonic = c.kernel;

@@ -1,31 +1,32 @@
 // Conversion between the monotonic and the global time base: the epoch offset
 // alone when there is no conversion, the user-space stand-in that follows the
-// wall clock, the kernel call's pass-through, and bad clock ids.
+// wall clock, the kernel call's pass-through and its own time point, and bad
+// clock ids.
 #include <gtest/gtest.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <cstdlib>
 #include <vector>
 
 #include "TestSupport.h"
-#include "engine/EngineDetail.h"
+#include "engine/SystemClock.h"
 #include "engine_test_helpers.h"
 
 using namespace enginetest;
 using quelta::ConvertClockTime;
 using quelta::gConvertStandInEnabled;
 using quelta::gConvertSyscallNr;
-using quelta::tKPusTimingEngine;
 
 namespace {
 
 constexpr int32_t kEpoch1904 = 2082844800;
 
 int64_t AbsDiff(uint64_t a, uint64_t b) { return std::abs(static_cast<int64_t>(a - b)); }
-timespec ToTs(uint64_t ns) { return quelta::WidenTimespec(quelta::SplitNanoseconds(ns)); }
-uint64_t FromTs(const timespec& ts) { return quelta::JoinNanoseconds(quelta::NarrowTimespec(ts)); }
+timespec ToTs(uint64_t ns) { return quelta::SplitNanoseconds(ns); }
+uint64_t FromTs(const timespec& ts) { return quelta::JoinNanoseconds(ts); }
 
 // A wall clock stepped by gStepNs against the real one.
 int64_t gStepNs = 0;
@@ -88,9 +89,10 @@ TEST_F(EngineConversionTest, WithoutAnyConversionOnlyTheEpochOffsetApplies) {
     engine->SetEpochOffset(-100);  // a negative offset moves the other way
     EXPECT_EQ(ToGlobal(1500000000ull), uint64_t(0) - 98500000000ull);
     EXPECT_EQ(ToMonotonic(uint64_t(0) - 98500000000ull), 1500000000ull);
-    engine->SetEpochOffset(0);  // seconds keep their low 32 bits through the timespec
-    EXPECT_EQ(ToGlobal((4294967296ull + 3) * kNs + 9), 3 * kNs + 9);
-    EXPECT_EQ(ToGlobal(2147483648ull * kNs), uint64_t(0) - 2147483648ull * kNs);
+    engine->SetEpochOffset(0);  // seconds beyond 31 and 32 bits pass whole through the timespec
+    EXPECT_EQ(ToGlobal((4294967296ull + 3) * kNs + 9), (4294967296ull + 3) * kNs + 9);
+    EXPECT_EQ(ToGlobal(2147483648ull * kNs), 2147483648ull * kNs);
+    EXPECT_EQ(ToMonotonic(2147483648ull * kNs + 1), 2147483648ull * kNs + 1);
 }
 
 TEST_F(EngineConversionTest, KernelCallIsPassedThroughAndBadClockIdsAreRefused) {
@@ -108,6 +110,71 @@ TEST_F(EngineConversionTest, KernelCallIsPassedThroughAndBadClockIdsAreRefused) 
         ts = Ts(5, 6);
         EXPECT_EQ(ConvertClockTime(c[0], c[1], &ts), c[2]) << c[0] << "->" << c[1];
         EXPECT_EQ(FromTs(ts), 5 * kNs + 6);
+    }
+}
+
+// A kernel conversion call that moves every time point forward by a fixed
+// number of seconds, or fails as a kernel does for a result it cannot hold.
+struct FakeConvertCall {
+    int calls = 0;
+    long lastSec = 0;
+    bool overflow = false;
+};
+FakeConvertCall gConvertCall;
+constexpr long kCallShiftS = 1000;
+long FakeConvert(long, int32_t, int32_t, quelta::KernelTimespec* t) {
+    ++gConvertCall.calls;
+    gConvertCall.lastSec = t->tv_sec;
+    if (gConvertCall.overflow) {
+        errno = EOVERFLOW;
+        return -1;
+    }
+    t->tv_sec += kCallShiftS;
+    return 0;
+}
+
+// The kernel call gets its own time point, with seconds as wide as the
+// kernel's long. What that cannot hold (a wall-clock time past 2038 on a
+// 32-bit target), and a result the call cannot hold, is converted in user
+// space instead.
+TEST_F(EngineConversionTest, KernelCallHoldsWhatItCanAndUserSpaceTheRest) {
+    UseFakeClock();
+    gFake.realtime = Ts(1900000000, 0);  // the stand-in's offset: realtime - monotonic
+    gFake.monotonic = Ts(1000, 0);
+    const int64_t standInShift = -int64_t(1899999000);
+    quelta::gSystemClock.convertTime = &FakeConvert;
+    gConvertSyscallNr.store(451);
+    const bool wideCall = sizeof(long) >= 8;
+    const struct {
+        int64_t sec;
+        bool overflow, standIn;
+        int calls;
+        int64_t wantSec;
+        int32_t result;
+    } cases[] = {
+        {2000000000, false, true, 1, 2000000000 + kCallShiftS, 0},  // 2033: the call converts
+        {2208988800, false, true, wideCall ? 1 : 0,                 // 2040
+         2208988800 + (wideCall ? kCallShiftS : standInShift), 0},
+        {4102444800, false, true, wideCall ? 1 : 0,                 // 2100
+         4102444800 + (wideCall ? kCallShiftS : standInShift), 0},
+        {2000000000, true, true, 1, 2000000000 + standInShift, 0},  // the call overflows
+        {2000000000, true, false, 1, 2000000000, 75},               // ...with nothing behind it
+        {4102444800, false, false, wideCall ? 1 : 0, 4102444800 + (wideCall ? kCallShiftS : 0),
+         wideCall ? 0 : 75},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(testing::Message() << c.sec << " overflow " << c.overflow << " standIn " << c.standIn);
+        gConvertCall = FakeConvertCall{};
+        gConvertCall.overflow = c.overflow;
+        gConvertStandInEnabled.store(c.standIn);
+        timespec ts = Ts(c.sec, 250);
+        EXPECT_EQ(ConvertClockTime(CLOCK_REALTIME, CLOCK_MONOTONIC, &ts), c.result);
+        EXPECT_EQ(gConvertCall.calls, c.calls);
+        if (c.calls != 0) {
+            EXPECT_EQ(gConvertCall.lastSec, static_cast<long>(c.sec));
+        }
+        EXPECT_EQ(static_cast<int64_t>(ts.tv_sec), c.wantSec);
+        EXPECT_EQ(ts.tv_nsec, 250);
     }
 }
 

@@ -20,7 +20,6 @@
 #include "tLinux/PalThreads.h"
 
 using namespace enginetest;
-using quelta::tKPusTimingEngine;
 
 namespace {
 
