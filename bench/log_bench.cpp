@@ -27,7 +27,6 @@
 
 namespace {
 
-using quelta::tKPLogEngine;
 using quelta::tKPusTimingEngine;
 
 // Opaque to the optimiser, so every call below stays a virtual call. Built

@@ -9,11 +9,12 @@
 #include <atomic>
 #include <cstdint>
 
+class tKPLogEngine;
+
 namespace quelta {
 
 class tKPusTimingEngine;
 class tKPusLinuxNanoSleepTimer;
-class tKPLogEngine;
 
 extern std::atomic<tKPLogEngine*> gLogEngine;
 extern std::atomic<tKPusLinuxNanoSleepTimer*> gTimer;

@@ -26,6 +26,10 @@ void MoveDown(uint32_t* array, uint32_t from, uint32_t copied) {
 
 }  // namespace
 
+}  // namespace quelta
+
+using namespace quelta;
+
 void tKPLogEngine::ReadOut7(uint32_t& count, uint32_t timeLow[], uint32_t timeHigh[],
                             uint32_t events[], uint32_t last) {
     ReadOutMerged(count, timeLow, timeHigh, events, nullptr, last);
@@ -135,5 +139,3 @@ void tKPLogEngine::ReadOutMerged(uint32_t& count, uint32_t timeLow[], uint32_t t
     // Recording resumes in the bank it was writing, untouched by the read.
     activeBank.store(frozen, kRelaxed);
 }
-
-}  // namespace quelta

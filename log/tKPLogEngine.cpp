@@ -47,6 +47,10 @@ void ReadLogClock(ClockTime& out) {
     out = FromU64(ns);
 }
 
+}  // namespace quelta
+
+using namespace quelta;
+
 void* tKPLogEngine::operator new(size_t bytes) noexcept { return PalMemAlloc(bytes); }
 
 void tKPLogEngine::operator delete(void* p) noexcept { PalMemFree(p); }
@@ -258,5 +262,3 @@ void tKPLogEngine::SetEnableValue(uint32_t value) {
     enableValue.store(value, kRelaxed);
     enabled.store(value, kRelaxed);
 }
-
-}  // namespace quelta

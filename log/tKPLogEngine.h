@@ -40,6 +40,23 @@ inline uint32_t FoldCpuIndex(int cpu, uint32_t cpuCount) {
 // engine and may be used without one.
 void ReadLogClock(ClockTime& out);
 
+// Holds a log engine's maintenance lock for a scope.
+class LogMaintenanceGuard {
+public:
+    explicit LogMaintenanceGuard(pthread_mutex_t& m) : m_(m) { pthread_mutex_lock(&m_); }
+    ~LogMaintenanceGuard() { pthread_mutex_unlock(&m_); }
+    LogMaintenanceGuard(const LogMaintenanceGuard&) = delete;
+    LogMaintenanceGuard& operator=(const LogMaintenanceGuard&) = delete;
+
+private:
+    pthread_mutex_t& m_;
+};
+
+}  // namespace quelta
+
+// The class lives in the global namespace, like the interface it implements:
+// its run-time type name is the runtime's plain `tKPLogEngine`. It stays out
+// of the dynamic symbol table (hidden visibility and the version script).
 class tKPLogEngine final : public iKPLogEngine {
 public:
     // Builds an engine with 5000-entry rings (fewer if their allocation
@@ -92,7 +109,7 @@ public:
     std::atomic<uint32_t> enableValue;
     std::atomic<uint32_t> capacityPerCpu;
     std::atomic<uint32_t> activeBank;    // 0 or cpuCount
-    LogCpuRecord* records;               // 2 x cpuCount, bank 0 then bank 1
+    quelta::LogCpuRecord* records;               // 2 x cpuCount, bank 0 then bank 1
 
 private:
     // Only Create builds engines: it discards one whose record array could
@@ -111,19 +128,5 @@ private:
 
     void Record(const ClockTime& time, uint32_t event, uint32_t data);
 };
-
-// Holds a log engine's maintenance lock for a scope.
-class LogMaintenanceGuard {
-public:
-    explicit LogMaintenanceGuard(pthread_mutex_t& m) : m_(m) { pthread_mutex_lock(&m_); }
-    ~LogMaintenanceGuard() { pthread_mutex_unlock(&m_); }
-    LogMaintenanceGuard(const LogMaintenanceGuard&) = delete;
-    LogMaintenanceGuard& operator=(const LogMaintenanceGuard&) = delete;
-
-private:
-    pthread_mutex_t& m_;
-};
-
-}  // namespace quelta
 
 #endif

@@ -13,7 +13,6 @@
 #include "log_test_helpers.h"
 
 using namespace logtest;
-using quelta::tKPLogEngine;
 
 // --- merge order ----------------------------------------------------------------
 
