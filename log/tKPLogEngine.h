@@ -14,6 +14,7 @@
 #include <cstddef>
 #include <cstdint>
 
+#include "log/LogMerge.h"
 #include "log/LogRecords.h"
 #include "quelta/iKPLogEngine.h"
 
@@ -60,8 +61,9 @@ private:
 class tKPLogEngine final : public iKPLogEngine {
 public:
     // Builds an engine with 5000-entry rings (fewer if their allocation
-    // fails). Returns null when the object or its record array cannot be
-    // allocated; nothing is left allocated then.
+    // fails), every page of them written already. Returns null when the
+    // object or its record array cannot be allocated; nothing is left
+    // allocated then.
     static tKPLogEngine* Create();
 
     ~tKPLogEngine() override;
@@ -109,7 +111,7 @@ public:
     std::atomic<uint32_t> enableValue;
     std::atomic<uint32_t> capacityPerCpu;
     std::atomic<uint32_t> activeBank;    // 0 or cpuCount
-    quelta::LogCpuRecord* records;               // 2 x cpuCount, bank 0 then bank 1
+    quelta::LogCpuRecord* records;       // 2 x cpuCount, bank 0 then bank 1
 
 private:
     // Only Create builds engines: it discards one whose record array could
@@ -125,6 +127,11 @@ private:
     // recorders): two read-outs at once would share the records' cursors and
     // empty each other's banks.
     pthread_mutex_t maintenanceLock = PTHREAD_MUTEX_INITIALIZER;
+
+    // The read-out's selection over the frozen bank, in the same allocation
+    // as the records (sized for cpuCount rings when the engine is built);
+    // used only under maintenanceLock.
+    quelta::LogMerge merge;
 
     void Record(const ClockTime& time, uint32_t event, uint32_t data);
 };
