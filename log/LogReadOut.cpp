@@ -60,7 +60,8 @@ void tKPLogEngine::ReadOutMerged(uint32_t& count, uint32_t timeLow[], uint32_t t
 
     // The write indices first, then one acquire fence, then what they
     // publish (wrap counts and entries): it pairs with each recorder's
-    // PublishFence, so every slot below an index seen here is whole.
+    // PublishFence, so every slot below an index seen here is whole. (Each
+    // index waits in its leaf's pos until the cursors are set.)
     for (uint32_t i = 0; i < n; ++i) merge.Leaf(i).pos = records[frozen + i].writeIndex.load(kRelaxed);
     std::atomic_thread_fence(std::memory_order_acquire);
 

@@ -60,7 +60,7 @@ inline uint32_t LogEntryCheck(uint32_t low, uint32_t high, uint32_t event, uint3
 // on ARMv7 this is the store barrier `dmb ishst`, cheaper than the full
 // `dmb ish` a release fence becomes; on x86 a release fence emits nothing.
 inline void PublishFence() {
-#if defined(__arm__) && !defined(__SANITIZE_THREAD__)
+#if defined(__arm__) && defined(__ARM_ARCH) && __ARM_ARCH >= 7 && !defined(__SANITIZE_THREAD__)
     __asm__ __volatile__("dmb ishst" ::: "memory");
 #else
     std::atomic_thread_fence(std::memory_order_release);
