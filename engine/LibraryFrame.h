@@ -10,11 +10,11 @@
 #include <cstdint>
 
 class tKPusTimingEngine;
+class tKPLogEngine;
 
 namespace quelta {
 
 class tKPusLinuxNanoSleepTimer;
-class tKPLogEngine;
 
 extern std::atomic<tKPLogEngine*> gLogEngine;
 extern std::atomic<tKPusLinuxNanoSleepTimer*> gTimer;

@@ -3,11 +3,13 @@
 //
 // The bank being written is frozen by pointing the recorders at the other
 // bank; its rings are then read from their newest entry backwards, and each
-// output entry is the latest of the rings' current heads, so the caller's
-// arrays fill from the top down and end up in ascending time order. Nothing
-// is locked: a recorder that chose its ring before the switch may still be
-// writing while we read, so entries can be torn or missed, but every index
-// read from a shared word is checked against the ring it is used on.
+// output entry is the latest of the rings' current heads (chosen by the
+// tournament tree of LogMerge), so the caller's arrays fill from the top down
+// and end up in ascending time order. Recorders take no lock: one that chose
+// its ring before the switch may still be writing while we read, so entries
+// can be missed or overwritten, but an entry torn by such a write fails its
+// check word and is left out, and every index read from a shared word is
+// checked against the ring it is used on.
 #include <cstring>
 
 #include "engine/ClockTimeOps.h"
@@ -25,6 +27,10 @@ void MoveDown(uint32_t* array, uint32_t from, uint32_t copied) {
 }
 
 }  // namespace
+
+}  // namespace quelta
+
+using namespace quelta;
 
 void tKPLogEngine::ReadOut7(uint32_t& count, uint32_t timeLow[], uint32_t timeHigh[],
                             uint32_t events[], uint32_t last) {
@@ -49,23 +55,35 @@ void tKPLogEngine::ReadOutMerged(uint32_t& count, uint32_t timeLow[], uint32_t t
     // before the cursors below are read: with a plain store the processor may
     // read the write indices first while the store still waits in its buffer,
     // and recorders would go on filling the frozen rings under the read for
-    // that long. One barrier per read-out; recording stays barrier-free.
+    // that long. One barrier per read-out; recording stays free of them.
     activeBank.store(other, std::memory_order_seq_cst);
 
+    // The write indices first, then one acquire fence, then what they
+    // publish (wrap counts and entries): it pairs with each recorder's
+    // PublishFence, so every slot below an index seen here is whole. (Each
+    // index waits in its leaf's pos until the cursors are set.)
+    for (uint32_t i = 0; i < n; ++i) merge.Leaf(i).pos = records[frozen + i].writeIndex.load(kRelaxed);
+    std::atomic_thread_fence(std::memory_order_acquire);
+
     // Cursors: each ring is read from its newest entry towards older ones. A
-    // write index beyond the ring (a recorder racing a Configure) is treated
-    // as a full ring.
+    // write index beyond the ring (a recorder that still held a ring an
+    // earlier Configure replaced) is treated as a full ring.
     uint64_t total = 0;
     for (uint32_t i = 0; i < n; ++i) {
         LogCpuRecord& record = records[frozen + i];
-        const LogRing ring = LoadRing(record);
-        const uint32_t written = record.writeIndex.load(std::memory_order_acquire);
+        LogMergeLeaf& leaf = merge.Leaf(i);
+        const LogRing ring = LockedRing(record);
+        const uint32_t written = leaf.pos;
         uint32_t remaining = record.wrapCount.load(kRelaxed) != 0 ? ring.capacity : written;
         if (remaining > ring.capacity) remaining = ring.capacity;
         uint32_t pos = written - 1;
         if (pos >= ring.capacity) pos = ring.capacity - 1;  // 0 on an empty ring
         record.readPos.store(pos, kRelaxed);
         record.readRemaining.store(remaining, kRelaxed);
+        leaf.entries = ring.entries;
+        leaf.capacity = ring.capacity;
+        leaf.pos = pos;
+        leaf.remaining = remaining;
         total += remaining;
     }
 
@@ -75,54 +93,38 @@ void tKPLogEngine::ReadOutMerged(uint32_t& count, uint32_t timeLow[], uint32_t t
     // starts afresh from here (the next read-out empties the frozen bank).
     if (m == 0) return;
 
+    for (uint32_t i = 0; i < n; ++i) merge.LoadHead(i);
+    merge.Build();
     uint32_t k = m;
     while (k > 0) {
-        // The latest head; ties go to the lower CPU index, which is seen
-        // first and only replaced by a strictly later time. The search starts
-        // from time 0, so a head stamped 0 (or with high word 0xFFFFFFFF, which
-        // orders before 0) is never chosen.
-        uint64_t bestTime = 0;
-        uint32_t best = n;
-        uint32_t bestEvent = 0;
-        uint32_t bestData = 0;
-        uint32_t bestPos = 0;
-        uint32_t bestCapacity = 0;
-        for (uint32_t i = 0; i < n; ++i) {
-            LogCpuRecord& record = records[frozen + i];
-            if (record.readRemaining.load(kRelaxed) == 0) continue;
-            const LogRing ring = LoadRing(record);
-            if (ring.capacity == 0) continue;
-            uint32_t pos = record.readPos.load(kRelaxed);
-            if (pos >= ring.capacity) pos = ring.capacity - 1;
-            const LogEntry& entry = ring.entries[pos];
-            const uint64_t time = entry.time.load(kRelaxed);
-            if (!Earlier(bestTime, time)) continue;
-            bestTime = time;
-            best = i;
-            bestEvent = entry.event.load(kRelaxed);
-            bestData = entry.data.load(kRelaxed);
-            bestPos = pos;
-            bestCapacity = ring.capacity;
-        }
-        // Every remaining head carries a time that is never chosen: stop
-        // here rather than hand out an entry that is not the latest.
-        if (best == n) break;
+        // The latest head; ties go to the lower CPU index. A head stamped 0
+        // (or with high word 0xFFFFFFFF, which orders before 0) is never
+        // chosen: when only such heads are left, stop here rather than hand
+        // out an entry that is not the latest.
+        const uint64_t key = merge.WinnerKey();
+        if (key == kLogNoHead) break;
+        const uint32_t best = merge.WinnerLeaf();
+        const LogMergeLeaf& head = merge.Leaf(best);
+        const uint64_t time = key - OrderKey(0);
 
         --k;
-        timeLow[k] = static_cast<uint32_t>(bestTime);
-        timeHigh[k] = static_cast<uint32_t>(bestTime >> 32);
+        timeLow[k] = static_cast<uint32_t>(time);
+        timeHigh[k] = static_cast<uint32_t>(time >> 32);
         // Bits 8-15 name the CPU; only its low 8 bits fit there.
-        events[k] = (bestEvent & ~0xFF00u) | ((best & 0xFFu) << 8);
-        if (data != nullptr) data[k] = bestData;
-
-        LogCpuRecord& chosen = records[frozen + best];
-        chosen.readPos.store(bestPos == 0 ? bestCapacity - 1 : bestPos - 1, kRelaxed);
-        const uint32_t remaining = chosen.readRemaining.load(kRelaxed);
-        chosen.readRemaining.store(remaining != 0 ? remaining - 1 : 0, kRelaxed);
+        events[k] = (head.event & ~0xFF00u) | ((best & 0xFFu) << 8);
+        if (data != nullptr) data[k] = head.data;
+        merge.Advance();
     }
 
-    // A stopped merge filled only indices k..m-1. Move them down so that the
-    // caller's arrays always hold `count` entries at 0..count-1, oldest first.
+    // The cursors where the merge left them.
+    for (uint32_t i = 0; i < n; ++i) {
+        records[frozen + i].readPos.store(merge.Leaf(i).pos, kRelaxed);
+        records[frozen + i].readRemaining.store(merge.Leaf(i).remaining, kRelaxed);
+    }
+
+    // A stopped merge (or one that left torn entries out) filled only indices
+    // k..m-1. Move them down so that the caller's arrays always hold `count`
+    // entries at 0..count-1, oldest first.
     if (k > 0) {
         const uint32_t copied = m - k;
         MoveDown(timeLow, k, copied);
@@ -135,5 +137,3 @@ void tKPLogEngine::ReadOutMerged(uint32_t& count, uint32_t timeLow[], uint32_t t
     // Recording resumes in the bank it was writing, untouched by the read.
     activeBank.store(frozen, kRelaxed);
 }
-
-}  // namespace quelta

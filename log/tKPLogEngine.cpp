@@ -5,6 +5,7 @@
 #include <sched.h>
 #include <time.h>
 
+#include <cstdint>
 #include <new>
 
 #include "engine/LibraryFrame.h"
@@ -30,6 +31,39 @@ void ClearRecord(LogCpuRecord& record) {
     record.wrapCount.store(0, kRelaxed);
 }
 
+// Writes every word of `count` entries. This is also what puts the ring's
+// pages in place: a new heap block is only address space until first
+// written, and the first write to each page would otherwise fault on a
+// recorder's path (one fault per page, each costing that recorder
+// microseconds).
+void ClearEntries(LogEntry* entries, uint32_t count) {
+    for (uint32_t i = 0; i < count; ++i) {
+        LogEntry& entry = entries[i];
+        entry.timeLow.store(0, kRelaxed);
+        entry.timeHigh.store(0, kRelaxed);
+        entry.event.store(0, kRelaxed);
+        entry.data.store(0, kRelaxed);
+        entry.check.store(0, kRelaxed);
+    }
+}
+
+// A heap ring of `capacity` entries behind its header, every page written;
+// null when the allocator refuses it or when it is too large to ask for.
+LogEntry* AllocateRing(uint32_t capacity) {
+    if (capacity >= kLogMaxRingEntries) return nullptr;
+    if (capacity > (SIZE_MAX - sizeof(LogRingHeader)) / sizeof(LogEntry)) return nullptr;  // 32-bit
+    void* block = PalMemAlloc(sizeof(LogRingHeader) + size_t(capacity) * sizeof(LogEntry));
+    if (block == nullptr) return nullptr;
+    LogRingHeader* header = new (block) LogRingHeader;
+    header->capacity.store(capacity, kRelaxed);
+    LogEntry* entries = reinterpret_cast<LogEntry*>(header + 1);
+    for (uint32_t i = 0; i < capacity; ++i) new (&entries[i]) LogEntry;
+    ClearEntries(entries, capacity);
+    return entries;
+}
+
+void FreeRing(LogEntry* entries) { PalMemFree(RingHeaderOf(entries)); }
+
 }  // namespace
 
 int (*gLogCpuQuery)() = QueryCpu;
@@ -46,6 +80,10 @@ void ReadLogClock(ClockTime& out) {
                         static_cast<uint64_t>(ts.tv_nsec);
     out = FromU64(ns);
 }
+
+}  // namespace quelta
+
+using namespace quelta;
 
 void* tKPLogEngine::operator new(size_t bytes) noexcept { return PalMemAlloc(bytes); }
 
@@ -74,11 +112,23 @@ tKPLogEngine::tKPLogEngine()
     const int32_t n = PalGetCpuCount();
     if (n > 1) cpuCount = static_cast<uint32_t>(n) < kLogMaxCpus ? static_cast<uint32_t>(n) : kLogMaxCpus;
 
+    // One allocation: the records, then the read-out's scratch.
     const uint32_t recordCount = 2 * cpuCount;
-    void* memory = PalMemAllocZeroed(sizeof(LogCpuRecord) * recordCount);
+    const size_t align = LogMerge::kScratchAlign;
+    const size_t scratchOffset = (sizeof(LogCpuRecord) * recordCount + align - 1) / align * align;
+    void* memory = PalMemAlloc(scratchOffset + LogMerge::ScratchBytes(cpuCount));
     if (memory == nullptr) return;  // Create reports the failure
     LogCpuRecord* array = static_cast<LogCpuRecord*>(memory);
-    for (uint32_t i = 0; i < recordCount; ++i) new (&array[i]) LogCpuRecord();
+    for (uint32_t i = 0; i < recordCount; ++i) {
+        LogCpuRecord* record = new (&array[i]) LogCpuRecord;
+        record->capacity.store(0, kRelaxed);
+        record->entries.store(nullptr, kRelaxed);
+        ClearRecord(*record);
+        ClearEntries(record->inlineEntries, kLogInlineSlots);
+        record->readPos.store(0, kRelaxed);
+        record->readRemaining.store(0, kRelaxed);
+    }
+    merge.Bind(static_cast<char*>(memory) + scratchOffset, cpuCount);
     records = array;
     capacityPerCpu.store(Configure(-1), kRelaxed);
 }
@@ -107,29 +157,32 @@ uint32_t tKPLogEngine::Configure(int32_t capacity) {
     for (uint32_t i = 0; i < recordCount; ++i) {
         LogCpuRecord& record = records[i];
         ClearRecord(record);
-        if (record.capacity.load(kRelaxed) == cap) continue;
+        const LogRing kept = LockedRing(record);
+        if (kept.capacity == cap) {
+            // The same ring, written through once more: whatever the system
+            // did with its pages since (swapped them out, say) is undone here
+            // and not on a recorder's path.
+            ClearEntries(kept.entries, kept.capacity);
+            continue;
+        }
 
-        // Detach the old ring before freeing it and before lowering the
-        // capacity, so that no recorder pairs a bound with a smaller array
-        // (see LoadRing).
-        LogEntry* old = record.entries.load(kRelaxed);
-        record.entries.store(record.inlineEntries, std::memory_order_release);
-        if (old != nullptr && old != record.inlineEntries) PalMemFree(old);
+        // Detach the old ring before freeing it. (Recorders take the bound
+        // of a heap ring from its own header, never from the record.)
+        record.entries.store(record.inlineEntries, kRelaxed);
         record.capacity.store(kLogInlineCapacity, kRelaxed);
+        if (kept.entries != nullptr && kept.entries != record.inlineEntries) FreeRing(kept.entries);
+        ClearEntries(record.inlineEntries, kLogInlineSlots);
         if (cap == 0) continue;
 
-        // The byte size must fit 32 bits on the target; a larger ring is
-        // treated like one the allocator refused, without asking it.
-        void* ring = nullptr;
-        if (cap < kLogMaxRingEntries) {
-            ring = PalMemAllocZeroed(static_cast<size_t>(cap) * sizeof(LogEntry));
-        }
+        LogEntry* ring = AllocateRing(cap);
         if (ring == nullptr) {
             failed = true;
             continue;
         }
         record.capacity.store(cap, kRelaxed);
-        record.entries.store(static_cast<LogEntry*>(ring), std::memory_order_release);
+        // Release: the header and the written entries before the pointer, so
+        // a recorder that loads the pointer finds both (see RecorderRing).
+        record.entries.store(ring, std::memory_order_release);
     }
     return failed ? kLogInlineCapacity : cap;
 }
@@ -141,29 +194,36 @@ void tKPLogEngine::Reconfigure() {
 // --- recording -------------------------------------------------------------
 
 // One entry into the ring of the CPU the caller runs on. No lock, no
-// allocation: one CPU query and a handful of word stores. Every shared word
-// is read once and range-checked, so that a racing Configure or read-out can
-// tear an entry but never send the store outside the ring.
+// allocation, no atomic read-modify-write: one CPU query, word loads and
+// stores, and one store barrier (none on x86) before the index that publishes
+// the entry. Every shared word is read once and range-checked, so that a
+// racing Configure or read-out can tear an entry but never send the store
+// outside the ring; the check word lets the read-out recognise such a tear.
 void tKPLogEngine::Record(const ClockTime& time, uint32_t event, uint32_t data) {
     if (enabled.load(kRelaxed) == 0) return;
     const uint32_t cpu = FoldCpuIndex(gLogCpuQuery(), cpuCount);
     const uint32_t bank = activeBank.load(kRelaxed) != 0 ? cpuCount : 0;
     LogCpuRecord& record = records[bank + cpu];
-    const LogRing ring = LoadRing(record);
+    const LogRing ring = RecorderRing(record);
     if (ring.capacity == 0) return;
 
     uint32_t slot = record.writeIndex.load(kRelaxed);
     const bool wraps = slot >= ring.capacity;
     if (wraps) slot = 0;
+    const uint32_t low = time.low;
+    const uint32_t high = time.high;
+    LogEntry& entry = ring.entries[slot];
+    entry.timeLow.store(low, kRelaxed);
+    entry.timeHigh.store(high, kRelaxed);
+    entry.event.store(event, kRelaxed);
+    entry.data.store(data, kRelaxed);
+    entry.check.store(LogEntryCheck(low, high, event, data), kRelaxed);
+    if (wraps) record.wrapCount.store(record.wrapCount.load(kRelaxed) + 1, kRelaxed);
     // The entry first, then the index that makes it part of the ring: a
     // read-out never takes a slot that was claimed but not yet written (it
     // would still hold an entry of an earlier round, seconds old).
-    LogEntry& entry = ring.entries[slot];
-    entry.time.store((static_cast<uint64_t>(time.high) << 32) | time.low, kRelaxed);
-    entry.event.store(event, kRelaxed);
-    entry.data.store(data, kRelaxed);
-    if (wraps) record.wrapCount.store(record.wrapCount.load(kRelaxed) + 1, kRelaxed);
-    record.writeIndex.store(slot + 1, std::memory_order_release);
+    PublishFence();
+    record.writeIndex.store(slot + 1, kRelaxed);
 }
 
 void tKPLogEngine::LogAt1(const ClockTime& time, uint32_t event) { Record(time, event, kLogNoData); }
@@ -258,5 +318,3 @@ void tKPLogEngine::SetEnableValue(uint32_t value) {
     enableValue.store(value, kRelaxed);
     enabled.store(value, kRelaxed);
 }
-
-}  // namespace quelta

@@ -14,6 +14,7 @@
 #include <cstddef>
 #include <cstdint>
 
+#include "log/LogMerge.h"
 #include "log/LogRecords.h"
 #include "quelta/iKPLogEngine.h"
 
@@ -40,11 +41,29 @@ inline uint32_t FoldCpuIndex(int cpu, uint32_t cpuCount) {
 // engine and may be used without one.
 void ReadLogClock(ClockTime& out);
 
+// Holds a log engine's maintenance lock for a scope.
+class LogMaintenanceGuard {
+public:
+    explicit LogMaintenanceGuard(pthread_mutex_t& m) : m_(m) { pthread_mutex_lock(&m_); }
+    ~LogMaintenanceGuard() { pthread_mutex_unlock(&m_); }
+    LogMaintenanceGuard(const LogMaintenanceGuard&) = delete;
+    LogMaintenanceGuard& operator=(const LogMaintenanceGuard&) = delete;
+
+private:
+    pthread_mutex_t& m_;
+};
+
+}  // namespace quelta
+
+// The class lives in the global namespace, like the interface it implements:
+// its run-time type name is the runtime's plain `tKPLogEngine`. It stays out
+// of the dynamic symbol table (hidden visibility and the version script).
 class tKPLogEngine final : public iKPLogEngine {
 public:
     // Builds an engine with 5000-entry rings (fewer if their allocation
-    // fails). Returns null when the object or its record array cannot be
-    // allocated; nothing is left allocated then.
+    // fails), every page of them written already. Returns null when the
+    // object or its record array cannot be allocated; nothing is left
+    // allocated then.
     static tKPLogEngine* Create();
 
     ~tKPLogEngine() override;
@@ -92,7 +111,7 @@ public:
     std::atomic<uint32_t> enableValue;
     std::atomic<uint32_t> capacityPerCpu;
     std::atomic<uint32_t> activeBank;    // 0 or cpuCount
-    LogCpuRecord* records;               // 2 x cpuCount, bank 0 then bank 1
+    quelta::LogCpuRecord* records;       // 2 x cpuCount, bank 0 then bank 1
 
 private:
     // Only Create builds engines: it discards one whose record array could
@@ -109,21 +128,12 @@ private:
     // empty each other's banks.
     pthread_mutex_t maintenanceLock = PTHREAD_MUTEX_INITIALIZER;
 
+    // The read-out's selection over the frozen bank, in the same allocation
+    // as the records (sized for cpuCount rings when the engine is built);
+    // used only under maintenanceLock.
+    quelta::LogMerge merge;
+
     void Record(const ClockTime& time, uint32_t event, uint32_t data);
 };
-
-// Holds a log engine's maintenance lock for a scope.
-class LogMaintenanceGuard {
-public:
-    explicit LogMaintenanceGuard(pthread_mutex_t& m) : m_(m) { pthread_mutex_lock(&m_); }
-    ~LogMaintenanceGuard() { pthread_mutex_unlock(&m_); }
-    LogMaintenanceGuard(const LogMaintenanceGuard&) = delete;
-    LogMaintenanceGuard& operator=(const LogMaintenanceGuard&) = delete;
-
-private:
-    pthread_mutex_t& m_;
-};
-
-}  // namespace quelta
 
 #endif

@@ -11,7 +11,6 @@
 #include "log_test_helpers.h"
 
 using namespace logtest;
-using quelta::tKPLogEngine;
 
 // --- switching recording on and off -------------------------------------------
 

@@ -1,6 +1,7 @@
 // The log engine's read-out through iKPLogEngine: merge order across CPUs,
 // ties, clipping, wrapped rings, data words, the bank switch, heads that are
-// never selected, real pinned threads, and recorders racing read-outs.
+// never selected, torn entries, the selection against the straightforward
+// one on 1 to 256 CPUs, real pinned threads, and recorders racing read-outs.
 #include <sched.h>
 
 #include <algorithm>
@@ -8,12 +9,12 @@
 #include <chrono>
 #include <map>
 #include <memory>
+#include <random>
 #include <thread>
 
 #include "log_test_helpers.h"
 
 using namespace logtest;
-using quelta::tKPLogEngine;
 
 // --- merge order ----------------------------------------------------------------
 
@@ -38,33 +39,6 @@ TEST_F(LogFixture, InterleavedCpusMergeNewestFirstIntoAscendingArrays) {
         EXPECT_EQ((std::vector<uint32_t>{r.low[i], r.high[i], r.events[i], r.data[i]}),
                   std::vector<uint32_t>(4, kUntouched)) << i;
     }
-}
-
-TEST_F(LogFixture, MergeUsesTheClockTimeOrderAndBreaksTiesByCpu) {
-    log->SetEnabled(1);
-    At(0, 0x00000001FFFFFFFFull, 1);
-    At(1, 0xFFFFFFFE00000000ull, 2);
-    At(2, 0x0000000200000000ull, 3);
-    At(3, 0xFFFFFFFF00000005ull, 4);  // high word 0xFFFFFFFF: before 0, never selected
-    EXPECT_EQ(ReadOut(log, 10).Events(), (std::vector<uint32_t>{0x001, 0x203, 0x102}));
-
-    Restart();
-    At(3, 100, 3);
-    At(0, 100, 0);
-    At(1, 100, 1);
-    At(2, 50, 2);
-    // Equal times: the lower CPU index lands at the higher array index.
-    EXPECT_EQ(ReadOut(log, 10).Events(), (std::vector<uint32_t>{0x202, 0x303, 0x101, 0x000}));
-}
-
-TEST_F(LogFixture, WrappedRingReturnsExactlyItsCapacityAcrossTheEnd) {
-    log->Configure(8);
-    log->SetEnabled(1);
-    At(0, 1, 100);
-    At(0, 2, 101);
-    for (uint32_t t = 3; t <= 15; ++t) At(1, t, t);  // 13 into 8 slots: wraps at slot 5
-    ASSERT_EQ(Record(1).writeIndex.load(), 5u);
-    EXPECT_EQ(ReadOut(log, 100).Times(), (std::vector<uint64_t>{1, 2, 8, 9, 10, 11, 12, 13, 14, 15}));
 }
 
 // --- the bank switch --------------------------------------------------------------
@@ -124,6 +98,141 @@ TEST_F(LogFixture, NeverSelectedHeadsStopTheMergeAndTheResultIsCompacted) {
     At(2, 0xFFFFFFFF12345678ull, 1);
     EXPECT_EQ(ReadOut(log, 4).count, 0u);
     EXPECT_EQ(engine->activeBank.load(), 0u);
+}
+
+// A slot whose words come from two recordings (a recorder overwriting it as
+// it is read) fails its check word and is left out; the ring's older entries
+// still come, and the result is compacted as for a stopped merge.
+TEST_F(LogFixture, TornEntriesAreLeftOut) {
+    log->SetEnabled(1);
+    for (uint32_t t = 1; t <= 4; ++t) At(1, t * 10, t);
+    At(2, 25, 5);
+    quelta::LogEntry* ring = Record(1).entries.load();
+    ring[1].timeHigh.store(1);  // a later recording's high word over 20's
+    ring[3].event.store(9);     // and one's event word over 40's
+    const ReadOutResult r = ReadOut(log, 10);
+    EXPECT_EQ(r.Times(), (std::vector<uint64_t>{10, 25, 30}));
+    EXPECT_EQ(r.Events(), (std::vector<uint32_t>{0x101, 0x205, 0x103}));
+}
+
+// --- the selection against the straightforward one --------------------------------
+
+namespace {
+
+// What was recorded on one CPU, in recording order; its ring holds the last
+// `capacity` of them.
+struct ModelEntry {
+    uint64_t time;
+    uint32_t event, data;
+};
+using Model = std::vector<std::vector<ModelEntry>>;
+
+// The read-out as the straightforward selection does it: for every output
+// entry scan the heads of all rings in CPU order, starting from a best time
+// of 0 and replacing it only by a strictly later one; stop when no head is
+// later than 0, and move what was copied down to index 0.
+ReadOutResult ReferenceReadOut(const Model& model, uint32_t capacity, uint32_t room) {
+    ReadOutResult r;
+    for (auto* v : {&r.low, &r.high, &r.events, &r.data}) v->assign(room + 1, kUntouched);
+    const size_t n = model.size();
+    std::vector<std::vector<ModelEntry>> held(n);  // each ring, oldest first
+    uint64_t total = 0;
+    for (size_t i = 0; i < n; ++i) {
+        const size_t keep = std::min<size_t>(model[i].size(), capacity);
+        held[i].assign(model[i].end() - keep, model[i].end());
+        total += keep;
+    }
+    const uint32_t m = static_cast<uint32_t>(std::min<uint64_t>(room, total));
+    uint32_t k = m;
+    while (k > 0) {
+        size_t best = n;
+        uint64_t bestTime = 0;
+        for (size_t i = 0; i < n; ++i) {
+            if (!held[i].empty() && quelta::Earlier(bestTime, held[i].back().time)) {
+                best = i;
+                bestTime = held[i].back().time;
+            }
+        }
+        if (best == n) break;
+        const ModelEntry e = held[best].back();
+        held[best].pop_back();
+        --k;
+        r.low[k] = static_cast<uint32_t>(e.time);
+        r.high[k] = static_cast<uint32_t>(e.time >> 32);
+        r.events[k] = (e.event & ~0xFF00u) | ((static_cast<uint32_t>(best) & 0xFFu) << 8);
+        r.data[k] = e.data;
+    }
+    r.count = m - k;
+    for (auto* v : {&r.low, &r.high, &r.events, &r.data}) std::copy(v->begin() + k, v->begin() + m, v->begin());
+    return r;
+}
+
+}  // namespace
+
+// Random logs on 1 to 256 CPUs (engines built through the CPU-count seam),
+// read out by the engine and by the reference: the same count, the same word
+// in every slot of every array, the same bank afterwards. The logs have equal
+// stamps across CPUs, wrapped, empty and inline rings, never-selected times,
+// rings out of time order, and read-outs of 0, some, all and more than held.
+TEST(LogReadOutSelection, MatchesTheStraightforwardSelection) {
+    struct RestoreSeam {
+        int (*saved)() = quelta::gLogCpuQuery;
+        ~RestoreSeam() { quelta::gLogCpuQuery = saved; }
+    } restore;
+    quelta::gLogCpuQuery = FakeCpuQuery;
+    std::mt19937 rng(20261123);
+    auto pick = [&](uint32_t bound) { return std::uniform_int_distribution<uint32_t>(0, bound - 1)(rng); };
+    constexpr uint64_t kBase = 0x1FFFFFFE0ull;  // stamps cross a high-word boundary
+    auto oddTime = [&]() -> uint64_t {          // never selected, or the latest there is
+        switch (pick(3)) {
+            case 0: return 0;
+            case 1: return 0xFFFFFFFF00000000ull | pick(4);
+            default: return 0xFFFFFFFE00000000ull | pick(4);
+        }
+    };
+    for (uint32_t cpus : {1u, 2u, 3u, 5u, 16u, 64u, 255u, 256u, 1 + pick(256)}) {
+        std::unique_ptr<tKPLogEngine> engine(CreateWithCpus(static_cast<int32_t>(cpus)));
+        ASSERT_NE(engine, nullptr);
+        ASSERT_EQ(engine->CpuCount(), cpus);
+        iKPLogEngine* log = engine.get();
+        for (int round = 0, rounds = cpus >= 64 ? 8 : 30; round < rounds; ++round) {
+            const uint32_t capacity = std::vector<uint32_t>{1, 2, 3, 7, 10, 16}[pick(6)];
+            log->Configure(capacity == 10 ? 0 : static_cast<int32_t>(capacity));  // 0: inline rings of 10
+            log->SetEnabled(1);
+            const bool ordered = pick(3) != 0;  // each ring in time order, as the log's own stamps are
+            Model model(cpus);
+            uint64_t held = 0;
+            for (uint32_t cpu = 0; cpu < cpus; ++cpu) {
+                const uint32_t records = pick(4) == 0 ? 0 : pick(3 * capacity);
+                uint64_t time = kBase + pick(8);
+                tFakeCpu = static_cast<int>(cpu);
+                for (uint32_t i = 0; i < records; ++i) {
+                    time += pick(3);
+                    const ModelEntry e{pick(ordered ? 60 : 4) == 0 ? oddTime() : ordered ? time : kBase + pick(40),
+                                       static_cast<uint32_t>(rng()), static_cast<uint32_t>(rng())};
+                    log->LogAtWithData(T(e.time), e.data, e.event);
+                    model[cpu].push_back(e);
+                }
+                held += std::min(records, capacity);
+            }
+            tFakeCpu = 0;
+            const uint32_t room = std::vector<uint32_t>{0, 1, pick(uint32_t(held) + 1), uint32_t(held),
+                                                        uint32_t(held) + 1 + pick(5)}[pick(5)];
+            SCOPED_TRACE(testing::Message() << cpus << " CPUs, round " << round << ", capacity " << capacity
+                                            << ", room " << room << " of " << held);
+            const uint32_t bank = engine->activeBank.load();
+            const ReadOutResult want = ReferenceReadOut(model, capacity, room);
+            for (int pass = 0; pass < (room > 0 && held > 0 ? 2 : 1); ++pass) {  // nothing is consumed
+                const ReadOutResult got = ReadOut(log, room);
+                ASSERT_EQ(got.count, want.count);
+                ASSERT_EQ(got.low, want.low);
+                ASSERT_EQ(got.high, want.high);
+                ASSERT_EQ(got.events, want.events);
+                ASSERT_EQ(got.data, want.data);
+                ASSERT_EQ(engine->activeBank.load(), std::min<uint64_t>(room, held) == 0 ? cpus - bank : bank);
+            }
+        }
+    }
 }
 
 // --- real CPUs ------------------------------------------------------------------
@@ -200,13 +309,12 @@ void RaceReadOuts(iKPLogEngine* log, uint32_t writers, bool ownCpus, Check check
 
 }  // namespace
 
-// One writer per CPU: every entry is a recording of that CPU's writer, and
-// each CPU's entries come out in recorded order except at the ring's ends,
-// which a writer that chose its ring just before the bank switch may still be
-// filling: its newest slot may be stale or torn, and in a full ring the
-// writes that reach memory only after the cursors were taken overwrite the
-// oldest slots (as many as the writer's stores still in flight). At least
-// half of each ring must come out whole and in order.
+// One writer per CPU: every entry is a whole recording of that CPU's
+// writer, and each CPU's entries come out in recorded order up to the newest
+// one, except at the oldest end of a full ring, which a writer that chose its
+// ring just before the bank switch may still be overwriting (as many slots as
+// its stores still in flight). At least half of each ring must come out in
+// order.
 TEST(LogReadOutConcurrency, ReadOutsRacingOneWriterPerCpu) {
     struct RestoreSeam {
         int (*saved)() = quelta::gLogCpuQuery;
@@ -224,25 +332,23 @@ TEST(LogReadOutConcurrency, ReadOutsRacingOneWriterPerCpu) {
         for (uint32_t k = 0; k < r.count; ++k) {
             const Decoded d = Decode(r, k, kWriters);
             const uint32_t cpu = Cpu(r.events[k]);
-            if (!d.wordsValid || (r.events[k] & 0xFFu) != cpu || cpu >= kWriters) ++failures;
+            if (!d.whole || (r.events[k] & 0xFFu) != cpu || cpu >= kWriters) ++failures;
             perCpu[cpu].push_back(d);
         }
         for (auto& [cpu, list] : perCpu) {
-            // Leaving out the newest, the list must end in a whole, strictly
-            // ascending run; what precedes it was overwritten late.
-            const size_t last = list.size() - 1;
-            size_t first = last;
-            while (first > 0 && list[first - 1].whole && (first == last || list[first - 1].seq < list[first].seq)) {
-                --first;
-            }
-            if (last - first < kCapacity / 2) ++failures;
+            // A strictly ascending run ends the list; what precedes it was
+            // overwritten late.
+            size_t first = list.size() - 1;
+            while (first > 0 && list[first - 1].seq < list[first].seq) --first;
+            if (list.size() - first < kCapacity / 2) ++failures;
         }
     });
     EXPECT_EQ(failures, 0);
 }
 
-// Writers on real CPUs share records, so entries may tear, but every word
-// handed out is one some writer recorded and the CPU index is in range.
+// Writers on real CPUs share records, so their stores into one slot mix, but
+// the read-out leaves such torn entries out: every entry handed out is one
+// recording, all four words, and the CPU index is in range.
 TEST(LogReadOutConcurrency, ReadOutsRacingWritersThatShareRecords) {
     std::unique_ptr<tKPLogEngine> engine(tKPLogEngine::Create());
     ASSERT_NE(engine, nullptr);
@@ -251,7 +357,7 @@ TEST(LogReadOutConcurrency, ReadOutsRacingWritersThatShareRecords) {
     const uint32_t writers = std::min(2 * engine->CpuCount() + 1, 7u);  // 3 bits in the time
     RaceReadOuts(engine.get(), writers, false, [&](const ReadOutResult& r) {
         for (uint32_t k = 0; k < r.count; ++k) {
-            ASSERT_TRUE(Decode(r, k, writers).wordsValid) << k;
+            ASSERT_TRUE(Decode(r, k, writers).whole) << k;
             ASSERT_LT(Cpu(r.events[k]), engine->CpuCount());
         }
     });

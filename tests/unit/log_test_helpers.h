@@ -18,10 +18,10 @@ inline thread_local int tFakeCpu = 0;  // what the CPU seam reports to this thre
 inline int FakeCpuQuery() { return tFakeCpu; }
 
 // An engine built as if `cpus` CPUs were online (it reads the count once).
-inline quelta::tKPLogEngine* CreateWithCpus(int32_t cpus) {
+inline tKPLogEngine* CreateWithCpus(int32_t cpus) {
     const int32_t saved = quelta::gCpuCount.load();
     quelta::gCpuCount.store(cpus);
-    quelta::tKPLogEngine* engine = quelta::tKPLogEngine::Create();
+    tKPLogEngine* engine = tKPLogEngine::Create();
     quelta::gCpuCount.store(saved);
     return engine;
 }
@@ -84,7 +84,7 @@ protected:
     const quelta::LogCpuRecord& Record(uint32_t i) const { return engine->records[i]; }
 
     int (*savedQuery)() = quelta::gLogCpuQuery;
-    quelta::tKPLogEngine* engine = nullptr;
+    tKPLogEngine* engine = nullptr;
     iKPLogEngine* log = nullptr;
 };
 
