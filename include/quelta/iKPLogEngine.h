@@ -190,11 +190,14 @@ public:
      * first, then points recording back; entries recorded during the
      * read-out are lost. It does not consume entries: the next read-out
      * returns them again while they are not overwritten. No allocation;
-     * costs about count × CPUs comparisons. Blocks while another read-out or
-     * reconfiguration runs.
+     * costs about count × log2(CPUs) comparisons. Blocks while another
+     * read-out or reconfiguration runs. An entry that a recorder was still
+     * writing (or that two recorders on one CPU tore) is left out.
      * \param[in,out] count in: the room of the arrays (not checked); out: the
-     *        entries written, at most the number held. 0 writes nothing and
-     *        starts the log afresh: the entries held before no longer appear.
+     *        entries written, at most the number held (fewer when entries are
+     *        left out as torn; the written ones are then at 0..count-1). 0
+     *        writes nothing and starts the log afresh: the entries held
+     *        before no longer appear.
      * \param timeLow receives the low words of the times, oldest at index 0,
      *        newest at count - 1; among equal times the lower CPU comes later.
      * \param timeHigh receives the high words of the times.
