@@ -78,6 +78,21 @@ void BM_TickServicePass(benchmark::State& state) {
 }
 BENCHMARK(BM_TickServicePass)->Arg(0)->Arg(16)->Arg(128)->Unit(benchmark::kNanosecond);
 
+// Starts the library in this process; false (the benchmark skipped) when its
+// timer thread cannot serve (no SCHED_FIFO).
+bool StartLibrary(benchmark::State& state) {
+    if (LibraryControl(0, 1, 0) == 1 && TimerServing()) return true;
+    state.SkipWithError("the library could not start with a serving timer");
+    LibraryControl(0, 0, 0);
+    return false;
+}
+
+// A global time an hour or so after `g`, at a random place.
+template <class Rng>
+ClockTime AnHourAfter(const ClockTime& g, Rng& rng) {
+    return FromU64(ToU64(g) + 3600ull * 1000000000ull + rng() % 1000000000ull);
+}
+
 double Percentile(std::vector<double> v, double p) {
     if (v.empty()) return 0;
     std::sort(v.begin(), v.end());
@@ -91,7 +106,7 @@ std::vector<WaitNode*> QueueGlobalNodes(PalSemaphore* semaphore, int count, std:
     ClockTime g;
     gEngine.load()->ReadGlobal2(g);
     for (int i = 0; i < count; ++i) {
-        const ClockTime d = FromU64(ToU64(g) + 3600ull * 1000000000ull + rng() % 1000000000ull);
+        const ClockTime d = AnHourAfter(g, rng);
         WaitNode* node = nullptr;
         if (quelta_iTSCEvent_Wait_Callback_C(semaphore, &d, nullptr, nullptr, 1, &node) == 0) nodes.push_back(node);
     }
@@ -102,11 +117,7 @@ std::vector<WaitNode*> QueueGlobalNodes(PalSemaphore* semaphore, int count, std:
 // then its cancellation. The insert's whole duration bounds the time it holds
 // the scheduler lock (its offset is measured before the lock is taken).
 void BM_InsertAmong127GlobalNodes(benchmark::State& state) {
-    if (LibraryControl(0, 1, 0) != 1 || !TimerServing()) {
-        state.SkipWithError("the library could not start with a serving timer");
-        LibraryControl(0, 0, 0);
-        return;
-    }
+    if (!StartLibrary(state)) return;
     std::mt19937 rng(11);
     PalSemaphore* semaphore = nullptr;
     PalSemaphoreCreate(&semaphore);
@@ -126,7 +137,7 @@ void BM_InsertAmong127GlobalNodes(benchmark::State& state) {
         node->isGlobal.store(1);
         node->autoRelease.store(0);
         node->semaphore.store(semaphore);
-        const ClockTime d = FromU64(ToU64(g) + 3600ull * 1000000000ull + rng() % 1000000000ull);
+        const ClockTime d = AnHourAfter(g, rng);
         const uint64_t t0 = MonoNs();
         InsertWaitNode(node, &d, nullptr, nullptr);
         us.push_back(static_cast<double>(MonoNs() - t0) / 1000.0);
@@ -154,11 +165,7 @@ void RecordCallback(void*) { gCallbackAt.store(MonoNs()); }
 // without it. The ratio of the two p99s is the cost a low-priority caller
 // imposes on the timer thread.
 void BM_CallbackLatenessWithLowPriorityInserter(benchmark::State& state) {
-    if (LibraryControl(0, 1, 0) != 1 || !TimerServing()) {
-        state.SkipWithError("the library could not start with a serving timer");
-        LibraryControl(0, 0, 0);
-        return;
-    }
+    if (!StartLibrary(state)) return;
     std::mt19937 rng(13);
     PalSemaphore* semaphore = nullptr;
     PalSemaphoreCreate(&semaphore);
@@ -174,7 +181,7 @@ void BM_CallbackLatenessWithLowPriorityInserter(benchmark::State& state) {
                 usleep(200);
                 continue;
             }
-            const ClockTime d = FromU64(ToU64(g) + 3600ull * 1000000000ull + r() % 1000000000ull);
+            const ClockTime d = AnHourAfter(g, r);
             WaitNode* node = nullptr;
             if (quelta_iTSCEvent_Wait_Callback_C(semaphore, &d, nullptr, nullptr, 1, &node) == 0) {
                 ReleaseWaitNode(node);
@@ -227,11 +234,7 @@ BENCHMARK(BM_CallbackLatenessWithLowPriorityInserter)->Iterations(4000)->Unit(be
 // Arm-to-fire lateness of an own-semaphore wait with a deadline between ticks
 // (1.3 ms + up to 0.5 ms ahead), on the live library, from a SCHED_FIFO thread.
 void BM_WaitBetweenTicksLateness(benchmark::State& state) {
-    if (LibraryControl(0, 1, 0) != 1 || !TimerServing()) {
-        state.SkipWithError("the library could not start with a serving timer");
-        LibraryControl(0, 0, 0);
-        return;
-    }
+    if (!StartLibrary(state)) return;
     sched_param p{};
     p.sched_priority = 50;
     const bool fifo = sched_setscheduler(0, SCHED_FIFO, &p) == 0;
