@@ -4,6 +4,8 @@
 #include "engine/SchedulerState.h"
 #include "engine/TickService.h"
 #include "engine/tKPusTimingEngine.h"
+#include "tLinux/PalSemaphoreOps.h"
+#include "tLinux/PalThreads.h"
 
 namespace testsupport {
 
@@ -44,6 +46,9 @@ SchedulerHarness::SchedulerHarness() {
 
 SchedulerHarness::~SchedulerHarness() {
     gTickNowOverride = nullptr;
+    for (WaitNode& n : pool) {
+        if (PalSemaphore* s = n.ownSemaphore.exchange(nullptr)) PalSemaphoreDestroy(s);
+    }
     gEventSystemReady.store(0);
     gWaitNodePool.store(nullptr);
     gFreeList.store(nullptr);
@@ -60,6 +65,15 @@ SchedulerHarness::~SchedulerHarness() {
 void SchedulerHarness::RemoveTimer() {
     delete gTimer.exchange(nullptr);
     timer = nullptr;
+}
+
+void SchedulerHarness::GiveNodesSemaphores() {
+    PalInitialize();
+    for (WaitNode& n : pool) {
+        PalSemaphore* s = nullptr;
+        PalSemaphoreCreate(&s);
+        n.ownSemaphore.store(s);
+    }
 }
 
 uint64_t SchedulerHarness::NowHook() { return now_; }

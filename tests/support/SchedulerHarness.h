@@ -32,6 +32,9 @@ public:
     uint64_t Now() const { return now_; }
     void Pass();          // one tick service pass at Now()
     void RemoveTimer();   // gTimer = null
+    // Gives every node its own semaphore, as start-up does (the waits that
+    // block on a node need one); the harness destroys them.
+    void GiveNodesSemaphores();
 
     ::WaitNode* Take();  // a node as the event waits take it
     FakeTimer* timer = nullptr;
