@@ -224,8 +224,11 @@ stage_timeout() { [ "$1" = unit ] && echo 240 || echo 480; }
 run_stage() {
   local label=$1 log=$2 exclude=$3 args=()
   [ -n "$exclude" ] && args=(-E "$exclude")
-  timeout -k 10 "$(stage_timeout "$label")" ctest --test-dir "$work/build" -L "$label" -LE 'long|hostclock' \
-    --stop-on-failure --output-on-failure "${args[@]}" >>"$log" 2>&1
+  # A mutant can turn a loop into a runaway that allocates without end: each
+  # test gets 4 GB of address space, far more than any needs.
+  (ulimit -v 4194304
+   timeout -k 10 "$(stage_timeout "$label")" ctest --test-dir "$work/build" -L "$label" -LE 'long|hostclock' \
+     --stop-on-failure --output-on-failure "${args[@]}") >>"$log" 2>&1
   local rc=$?
   if [ $rc -eq 124 ] || [ $rc -eq 137 ]; then echo timeout; return 1; fi
   if [ $rc -ne 0 ]; then
@@ -240,7 +243,7 @@ run_stage() {
 echo "baseline run (tests that fail here are left out)"
 failing=()
 for label in "${stages[@]}"; do
-  timeout -k 10 600 ctest --test-dir "$work/build" -L "$label" -LE 'long|hostclock' \
+  (ulimit -v 4194304; timeout -k 10 600 ctest --test-dir "$work/build" -L "$label" -LE 'long|hostclock') \
     >"$work/logs/baseline-$([ "$label" = unit ] && echo unit || echo rest).log" 2>&1
 done
 while read -r t; do failing+=("$t"); done < <(sed -n 's/.*Test *#[0-9]*: \([^ ]*\) .*\*\*\*.*/\1/p' "$work"/logs/baseline-*.log)

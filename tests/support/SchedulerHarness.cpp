@@ -1,5 +1,8 @@
 #include "SchedulerHarness.h"
 
+#include <cstdio>
+#include <cstdlib>
+
 #include "engine/LibraryFrame.h"
 #include "engine/SchedulerState.h"
 #include "engine/TickService.h"
@@ -13,8 +16,20 @@ using namespace quelta;
 
 uint64_t SchedulerHarness::now_ = 0;
 
+namespace {
+constexpr size_t kMaxArmings = 1000000;
+}
+
 FakeTimer::FakeTimer() {
     state.status.store(static_cast<int32_t>(TimerThreadStatus::kServing));
+}
+
+void FakeTimer::SetExpiry(ClockTime when) {
+    if (armed.size() >= kMaxArmings) {
+        std::fprintf(stderr, "the timer was armed %zu times: a runaway scheduler\n", armed.size());
+        std::abort();
+    }
+    armed.push_back(when);
 }
 
 uint64_t FakeTimer::LastArmed() const {

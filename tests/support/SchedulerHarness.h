@@ -16,7 +16,9 @@ namespace testsupport {
 class FakeTimer : public quelta::tKPusLinuxNanoSleepTimer {
 public:
     FakeTimer();
-    void SetExpiry(ClockTime when) override { armed.push_back(when); }
+    // Records each arming. A scheduler that re-arms without end (a fault)
+    // ends the test process rather than filling the machine's memory.
+    void SetExpiry(ClockTime when) override;
     void ExpireNow() override { expireNowCalls++; }
     uint64_t LastArmed() const;
     std::vector<ClockTime> armed;
