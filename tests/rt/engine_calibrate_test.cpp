@@ -1,5 +1,7 @@
-// Calibrate on a running library: the tick service records 1000 lateness
-// samples while Calibrate waits, and the record comes out consistent.
+// Calibrate on a running library: the real tick service records 1000
+// lateness samples while Calibrate waits (the record's arithmetic is checked
+// on known inputs in the unit tests; here only that the live pieces meet and
+// the samples are those of a working machine).
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -45,15 +47,6 @@ TEST(EngineCalibrateTest, TickServiceFillsTheJitterSamples) {
     // Now and then a tick is late by milliseconds on a noisy machine; most
     // are well within a tick period.
     EXPECT_LT(Median(jitter), 1000000u) << "median tick lateness of 1 ms or more";
-    // The means and their difference, as Calibrate defines them.
-    double rawSum = 0, globalSum = 0;
-    for (int i = 0; i < 1000; ++i) {
-        rawSum += raw[i];
-        globalSum += global[i];
-    }
-    const uint32_t rawCost = static_cast<uint32_t>(std::min(rawSum / 1000.0 + 0.5, 4294967295.0));
-    EXPECT_EQ(block[2], rawCost);
-    EXPECT_EQ(block[3], static_cast<uint32_t>(globalSum / 1000.0 + 0.5) - rawCost);
     // A raw sample is the pair's difference d (ns) times 1000 over the clock
     // rate; back in ns, a typical pair is well under 0.1 ms apart.
     const double medianRawNs = Median(raw) * rate / 1000.0;
