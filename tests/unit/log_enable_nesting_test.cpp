@@ -10,6 +10,8 @@
 #include "engine/ClockTimeOps.h"
 #include "log/tKPLogEngine.h"
 
+using namespace quelta;  // the engine class, wherever its namespace
+
 namespace {
 
 // True when the engine records: an entry of its own (a new time and event)
@@ -19,7 +21,7 @@ bool Records(iKPLogEngine* log) {
     static uint32_t probe = 0;
     ++probe;
     const uint32_t event = probe << 16;
-    log->LogAt1(quelta::FromU64(1000000 + probe), event);
+    log->LogAt1(FromU64(1000000 + probe), event);
     uint32_t low[64], high[64], events[64];
     uint32_t count = 64;
     log->ReadOutMerged(count, low, high, events, nullptr, 0);
@@ -30,7 +32,7 @@ bool Records(iKPLogEngine* log) {
 }
 
 TEST(LogEnableNesting, AdjustmentsFromManyThreadsAreAllCounted) {
-    iKPLogEngine* log = quelta::tKPLogEngine::Create();
+    iKPLogEngine* log = tKPLogEngine::Create();
     ASSERT_NE(log, nullptr);
     constexpr int kThreads = 4, kEach = 50000;
     std::atomic<int> ready{0};
