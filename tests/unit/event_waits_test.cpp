@@ -304,12 +304,12 @@ TEST_F(WithoutTickService, EventWaitsWaitWholeMillisecondsPlusOne) {
         SCOPED_TRACE(timeout);
         ExpectMilliseconds(ms, [&, timeout = timeout] { EXPECT_EQ(quelta_iTSCEvent_Wait_C(semaphore, timeout), 1u); });
     }
-    uint32_t r = 99;
-    Waiter forever([&] { r = quelta_iTSCEvent_Wait_C(semaphore, 0xFFFFFFFFu); });
-    EXPECT_FALSE(Within(30, [&] { return r != 99u; })) << "no timeout, yet it ended";
+    std::atomic<uint32_t> r{99};
+    Waiter forever([&] { r.store(quelta_iTSCEvent_Wait_C(semaphore, 0xFFFFFFFFu)); });
+    EXPECT_FALSE(Within(30, [&] { return r.load() != 99u; })) << "no timeout, yet it ended";
     PalSemaphorePost(semaphore);
     EXPECT_TRUE(forever.ReturnsWithin(1000));
-    EXPECT_EQ(r, 0u);
+    EXPECT_EQ(r.load(), 0u);
 
     ClockTime now;
     gEngine.load()->ReadMonotonic0(now);

@@ -85,12 +85,12 @@ TEST_F(PalSemaphoreTest, AWaiterTimingOutDropsOnlySurplusPosts) {
     for (int posts : {1, 2}) {
         SCOPED_TRACE(posts);
         std::atomic<uint32_t> result{99};
-        std::thread waiter([&] { result = PalSemaphoreWait(sem_, 150); });
+        std::thread waiter([&] { result = PalSemaphoreWait(sem_, 300); });
         AwaitWaiters(1);
         pthread_mutex_lock(&sem_->mutex);
         std::vector<std::thread> posters;
         for (int i = 0; i < posts; ++i) posters.emplace_back([this] { PalSemaphorePost(sem_); });
-        std::this_thread::sleep_for(milliseconds(400));  // the waiter's deadline passes
+        std::this_thread::sleep_for(milliseconds(700));  // the waiter's deadline passes
         pthread_mutex_unlock(&sem_->mutex);
         for (auto& t : posters) t.join();
         waiter.join();
