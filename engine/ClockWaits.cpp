@@ -10,6 +10,7 @@
 
 #include "engine/ClockTimeOps.h"
 #include "engine/LibraryFrame.h"
+#include "engine/SystemClock.h"
 #include "engine/U64Arith.h"
 #include "engine/tKPusTimingEngine.h"
 #include "quelta/quelta.h"
@@ -73,7 +74,7 @@ void SleepUntilClocks(ClockTime deadline) {
     const timespec request = SplitClocks(deadline);
     // A signal handler interrupting the sleep must not shorten it: the same
     // absolute deadline is simply slept on again.
-    while (clock_nanosleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &request, nullptr) == EINTR) {
+    while (gSystemClock.sleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &request, nullptr) == EINTR) {
     }
 }
 
@@ -81,7 +82,7 @@ void SleepClocks(ClockTime duration) {
     timespec request = SplitClocks(duration);
     timespec remaining{};
     // An interrupted relative sleep resumes with what was left, not anew.
-    while (clock_nanosleep(CLOCK_MONOTONIC, 0, &request, &remaining) == EINTR) {
+    while (gSystemClock.sleep(CLOCK_MONOTONIC, 0, &request, &remaining) == EINTR) {
         request = remaining;
     }
 }

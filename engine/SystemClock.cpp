@@ -28,6 +28,7 @@ constexpr SystemClockHooks kRealHooks = {
     &::adjtimex,
     &RealClockTicksPerSecond,
     &RealConvertTime,
+    &::clock_nanosleep,
 };
 
 }  // namespace

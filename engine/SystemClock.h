@@ -1,7 +1,7 @@
-// The kernel clock calls the engine makes, behind one seam.
+// The kernel clock calls the engine and the plain waits make, behind one seam.
 //
 // Production uses the real calls; tests replace single entries to check
-// exact arithmetic (rates, steps, failures) without touching the machine's
+// exact arithmetic (rates, steps, deadlines, failures) without touching the machine's
 // clock. The table is written only while no other thread uses the engine.
 #ifndef QUELTA_ENGINE_SYSTEMCLOCK_H
 #define QUELTA_ENGINE_SYSTEMCLOCK_H
@@ -31,6 +31,11 @@ struct SystemClockHooks {
     long (*clockTicksPerSecond)();  // sysconf(_SC_CLK_TCK)
     // The kernel's clock conversion call: syscall(number, from, to, time).
     long (*convertTime)(long number, int32_t fromClock, int32_t toClock, KernelTimespec* time);
+    // clock_nanosleep: the plain waits' sleeps, absolute and relative. A
+    // test that scripts the time sees the exact deadline the wait asked for
+    // (the 32-bit arithmetic of the next-multiple waits only runs while the
+    // clock is below 2^32 ns, which no real sleep can show).
+    int (*sleep)(clockid_t, int flags, const struct timespec* request, struct timespec* remaining);
 };
 
 extern SystemClockHooks gSystemClock;

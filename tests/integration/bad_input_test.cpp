@@ -3,6 +3,7 @@
 // and without disturbing the wait nodes.
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <vector>
 
 #include "LibraryFixture.h"
@@ -65,6 +66,9 @@ TEST_F(BadInput, ZeroArgumentsMeanNoWait) {
     EXPECT_LT(MonoNowNs() - t0, 50 * kMs);
 }
 
+std::atomic<int> gNeverCalls{0};
+void CountNeverCall(void*) { gNeverCalls.fetch_add(1); }
+
 TEST_F(BadInput, SpecialTimesAsDeadlines) {
     PalSemaphore* s = testsupport::NewRuntimeSemaphore();
     // NeverTime never fires; the node waits until it is cancelled.
@@ -77,9 +81,26 @@ TEST_F(BadInput, SpecialTimesAsDeadlines) {
     EXPECT_EQ(api().EventWaitCallback(nullptr, &before, nullptr, nullptr, 0, nullptr), 0u);
     EXPECT_LT(MonoNowNs() - t0, 200 * kMs);
     engine()->ReleaseWait(n);
-    // A past global target or a NeverTime callback time: no wait, nothing fires.
+    // A past global target: no wait, abort flag 0, the time after the call.
+    ClockTime g;
+    uint32_t generation = 0;
+    engine()->ReadGlobalWithGeneration(g, generation);
+    const ClockTime past = CT(U64(g) - 1000 * kMs);
+    uint32_t abortFlag = 7;
+    ClockTime after{};
+    const uint64_t t1 = MonoNowNs();
+    api().WaitUntilGlobalClocks64(&past, &abortFlag, &after, generation);
+    EXPECT_LT(MonoNowNs() - t1, 100 * kMs);
+    EXPECT_EQ(abortFlag, 0u);
+    EXPECT_GE(U64(after), U64(g));
+    // NeverTime callback times are stored (1) and never fire.
+    gNeverCalls.store(0);
+    api().SetCallback(&CountNeverCall, nullptr);
     EXPECT_EQ(api().SetCallbackTime(&never, 0), 1u);
     EXPECT_EQ(api().SetCallbackTime(&never, -1), 1u);
+    api().WaitMicroSeconds(20000);  // twenty ticks
+    api().SetCallback(nullptr, nullptr);
+    EXPECT_EQ(gNeverCalls.load(), 0);
     testsupport::DeleteRuntimeSemaphore(s);
     ExpectPoolWhole();
 }

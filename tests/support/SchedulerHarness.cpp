@@ -1,9 +1,14 @@
 #include "SchedulerHarness.h"
 
+#include <cstdio>
+#include <cstdlib>
+
 #include "engine/LibraryFrame.h"
 #include "engine/SchedulerState.h"
 #include "engine/TickService.h"
 #include "engine/tKPusTimingEngine.h"
+#include "tLinux/PalSemaphoreOps.h"
+#include "tLinux/PalThreads.h"
 
 namespace testsupport {
 
@@ -11,8 +16,20 @@ using namespace quelta;
 
 uint64_t SchedulerHarness::now_ = 0;
 
+namespace {
+constexpr size_t kMaxArmings = 1000000;
+}
+
 FakeTimer::FakeTimer() {
     state.status.store(static_cast<int32_t>(TimerThreadStatus::kServing));
+}
+
+void FakeTimer::SetExpiry(ClockTime when) {
+    if (armed.size() >= kMaxArmings) {
+        std::fprintf(stderr, "the timer was armed %zu times: a runaway scheduler\n", armed.size());
+        std::abort();
+    }
+    armed.push_back(when);
 }
 
 uint64_t FakeTimer::LastArmed() const {
@@ -44,6 +61,9 @@ SchedulerHarness::SchedulerHarness() {
 
 SchedulerHarness::~SchedulerHarness() {
     gTickNowOverride = nullptr;
+    for (WaitNode& n : pool) {
+        if (PalSemaphore* s = n.ownSemaphore.exchange(nullptr)) PalSemaphoreDestroy(s);
+    }
     gEventSystemReady.store(0);
     gWaitNodePool.store(nullptr);
     gFreeList.store(nullptr);
@@ -60,6 +80,15 @@ SchedulerHarness::~SchedulerHarness() {
 void SchedulerHarness::RemoveTimer() {
     delete gTimer.exchange(nullptr);
     timer = nullptr;
+}
+
+void SchedulerHarness::GiveNodesSemaphores() {
+    PalInitialize();
+    for (WaitNode& n : pool) {
+        PalSemaphore* s = nullptr;
+        PalSemaphoreCreate(&s);
+        n.ownSemaphore.store(s);
+    }
 }
 
 uint64_t SchedulerHarness::NowHook() { return now_; }

@@ -16,7 +16,9 @@ namespace testsupport {
 class FakeTimer : public quelta::tKPusLinuxNanoSleepTimer {
 public:
     FakeTimer();
-    void SetExpiry(ClockTime when) override { armed.push_back(when); }
+    // Records each arming. A scheduler that re-arms without end (a fault)
+    // ends the test process rather than filling the machine's memory.
+    void SetExpiry(ClockTime when) override;
     void ExpireNow() override { expireNowCalls++; }
     uint64_t LastArmed() const;
     std::vector<ClockTime> armed;
@@ -32,6 +34,9 @@ public:
     uint64_t Now() const { return now_; }
     void Pass();          // one tick service pass at Now()
     void RemoveTimer();   // gTimer = null
+    // Gives every node its own semaphore, as start-up does (the waits that
+    // block on a node need one); the harness destroys them.
+    void GiveNodesSemaphores();
 
     ::WaitNode* Take();  // a node as the event waits take it
     FakeTimer* timer = nullptr;

@@ -96,12 +96,24 @@ TEST_F(EngineConversionTest, WithoutAnyConversionOnlyTheEpochOffsetApplies) {
 }
 
 TEST_F(EngineConversionTest, KernelCallIsPassedThroughAndBadClockIdsAreRefused) {
-    // getpid ignores its arguments: it stands in for a kernel call that fails
-    // to convert. Its result comes back as it is and the time point stays.
-    gConvertSyscallNr.store(static_cast<int32_t>(SYS_getpid));
+    // The system call gets its number and then from, to and the time point,
+    // in that order. kill stands in for it for one call, with arguments that
+    // make it harmless either way: kill(from, to) for a process that does not
+    // exist and signal 0 fails with ESRCH; with the two swapped it would fail
+    // with EINVAL (no signal of that number). Its result comes back as it is
+    // and the time point stays as the call left it. (Never with real clock
+    // ids: kill(0, 1) would hang up the whole process group.)
+    gConvertSyscallNr.store(static_cast<int32_t>(SYS_kill));
     timespec ts = Ts(77, 88);
-    EXPECT_EQ(ConvertClockTime(99, 98, &ts), static_cast<int32_t>(getpid()));
+    errno = 0;
+    const int32_t r = ConvertClockTime(0x7FFFFFF0, 0, &ts);
+    const int error = errno;
+    gConvertSyscallNr.store(static_cast<int32_t>(SYS_getpid));
+    EXPECT_EQ(r, -1);
+    EXPECT_EQ(error, ESRCH) << "from and to were not passed in order";
     EXPECT_EQ(FromTs(ts), 77 * kNs + 88);
+    // getpid ignores its arguments: a call that converts nothing leaves the
+    // engine's result as the offset alone.
     EXPECT_EQ(ToMonotonic(2082844801500000000ull), 1500000000ull);
 
     gConvertSyscallNr.store(-1);
@@ -118,13 +130,16 @@ TEST_F(EngineConversionTest, KernelCallIsPassedThroughAndBadClockIdsAreRefused) 
 struct FakeConvertCall {
     int calls = 0;
     long lastSec = 0;
+    int32_t lastFrom = -1, lastTo = -1;
     bool overflow = false;
 };
 FakeConvertCall gConvertCall;
 constexpr long kCallShiftS = 1000;
-long FakeConvert(long, int32_t, int32_t, quelta::KernelTimespec* t) {
+long FakeConvert(long, int32_t from, int32_t to, quelta::KernelTimespec* t) {
     ++gConvertCall.calls;
     gConvertCall.lastSec = t->tv_sec;
+    gConvertCall.lastFrom = from;
+    gConvertCall.lastTo = to;
     if (gConvertCall.overflow) {
         errno = EOVERFLOW;
         return -1;
@@ -172,6 +187,8 @@ TEST_F(EngineConversionTest, KernelCallHoldsWhatItCanAndUserSpaceTheRest) {
         EXPECT_EQ(gConvertCall.calls, c.calls);
         if (c.calls != 0) {
             EXPECT_EQ(gConvertCall.lastSec, static_cast<long>(c.sec));
+            EXPECT_EQ(gConvertCall.lastFrom, CLOCK_REALTIME);
+            EXPECT_EQ(gConvertCall.lastTo, CLOCK_MONOTONIC);
         }
         EXPECT_EQ(static_cast<int64_t>(ts.tv_sec), c.wantSec);
         EXPECT_EQ(ts.tv_nsec, 250);

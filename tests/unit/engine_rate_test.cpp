@@ -282,12 +282,39 @@ struct FakeTicker {
     }
 };
 
+// A kernel clock whose back-to-back reads are a known distance apart: in the
+// n-th raw pair 40 ns, or 41 ns when n is odd; in the n-th wall-clock pair
+// 103 ns when n is a multiple of 4, else 100 ns (and 1 us between pairs).
+struct PairedClock {
+    uint64_t raw = 5 * kNs, real = 1700000000ull * kNs;
+    int rawReads = 0, realReads = 0;
+};
+PairedClock gPaired;
+int PairedGetTime(clockid_t id, timespec* ts) {
+    uint64_t* t = nullptr;
+    if (id == CLOCK_MONOTONIC_RAW) {
+        const int k = gPaired.rawReads++;
+        gPaired.raw += k % 2 == 0 ? 1000 : 40 + (k / 2) % 2;
+        t = &gPaired.raw;
+    } else if (id == CLOCK_REALTIME) {
+        const int k = gPaired.realReads++;
+        gPaired.real += k % 2 == 0 ? 1000 : (k / 2) % 4 == 0 ? 103 : 100;
+        t = &gPaired.real;
+    } else {
+        return clock_gettime(id, ts);
+    }
+    *ts = quelta::SplitNanoseconds(*t);
+    return 0;
+}
+
 TEST_F(EngineRateTest, CalibrateFillsTheRecordFromReadPairsAndTicks) {
     // One kernel tick per microsecond and tick 1000: the clock rate is 1000
-    // ticks per microsecond, so a raw sample is the raw pair's difference in ns.
+    // ticks per microsecond, so a raw sample is the raw pair's distance in ns.
     gFake.ticksPerSecond = 1000000;
     gFake.readTick = 1000;
     quelta::KernelTickRate();
+    gPaired = PairedClock{};
+    quelta::gSystemClock.getTime = &PairedGetTime;
     std::vector<uint32_t> jitter(1000, 7000);
     for (size_t i = 0; i < 600; ++i) jitter[i * 5 / 3] = 52;  // bucket 5 -> 50
     FakeTicker ticker(engine, jitter, 1000);
@@ -300,20 +327,18 @@ TEST_F(EngineRateTest, CalibrateFillsTheRecordFromReadPairsAndTicks) {
     e->CopyStatistics(block.data(), 1);
     EXPECT_EQ(block[0], 0u);
     EXPECT_EQ(block[1], 50u);
-    double rawSum = 0, globalSum = 0;
     for (size_t i = 0; i < 1000; ++i) {
-        ASSERT_EQ(block[4 + i], jitter[i]);
-        ASSERT_LT(block[1004 + i], 100000000u) << "a raw read pair 0.1 s apart?";
-        ASSERT_LT(block[2004 + i], 100000000u) << "a global read pair 0.1 s apart?";
-        rawSum += block[1004 + i];
-        globalSum += block[2004 + i];
+        ASSERT_EQ(block[4 + i], jitter[i]) << i;
+        ASSERT_EQ(block[1004 + i], 40u + i % 2) << i;
+        ASSERT_EQ(block[2004 + i], i % 4 == 0 ? 103u : 100u) << i;
     }
-    const uint32_t rawCost = static_cast<uint32_t>(rawSum / 1000.0 + 0.5);
-    EXPECT_EQ(block[2], rawCost);
-    EXPECT_EQ(block[3], static_cast<uint32_t>(globalSum / 1000.0 + 0.5) - rawCost);
+    // Raw pairs 40.5 ns on average, rounded to 41; wall-clock pairs 100.75,
+    // rounded to 101, which is 60 more than the raw cost.
+    EXPECT_EQ(block[2], 41u);
+    EXPECT_EQ(block[3], 60u);
     ClockTime g;
     e->LoadLastGlobal(g);
-    EXPECT_NE(U64(g), 0u) << "the global pairs are read through the engine";
+    EXPECT_EQ(U64(g), gPaired.real) << "the wall-clock pairs are read through the engine";
 }
 
 TEST_F(EngineRateTest, RawSamplesScaleWithTheClockRateAndSaturate) {

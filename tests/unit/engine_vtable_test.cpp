@@ -222,8 +222,10 @@ TEST_F(EngineVtableTest, Slots43To44And54To55FlagServiceAndTickCallback) {
     quelta::gControlFlag.store(savedFlag);
 
     EXPECT_EQ(Slot<uint32_t>(e, 44), 1u);
-    engine->serviceMode.store(2);
-    EXPECT_EQ(Slot<uint32_t>(e, 44), 0u);
+    for (uint32_t mode : {1u, 2u, 0xFFFFFFFFu}) {  // any mode but 0: no tick service
+        engine->serviceMode.store(mode);
+        EXPECT_EQ(Slot<uint32_t>(e, 44), 0u) << mode;
+    }
     engine->serviceMode.store(0);
 
     Slot<void, QueltaTickCallbackFn>(e, 54, &TickFn);

@@ -75,20 +75,29 @@ TEST_F(PalSemaphoreTest, BlockedWaiterTakesOneOfTwoPostsAndSignalsDoNotWakeIt) {
     sigaction(SIGUSR1, &old, nullptr);
 }
 
-TEST_F(PalSemaphoreTest, TimedOutSoleWaiterTrimsTwoPostsToOne) {
-    std::atomic<uint32_t> result{99};
-    std::thread waiter([&] { result = PalSemaphoreWait(sem_, 30); });
-    AwaitWaiters(1);
-    // Hold the mutex past the waiter's deadline and let two posts land
-    // meanwhile (count 0 -> 1 -> 2 with one waiter): the wait has timed out
-    // before it sees them.
-    pthread_mutex_lock(&sem_->mutex);
-    std::this_thread::sleep_for(milliseconds(80));
-    sem_->count = 2;
-    pthread_mutex_unlock(&sem_->mutex);
-    waiter.join();
-    EXPECT_EQ(result.load(), 1u);
-    EXPECT_EQ(Counters(), Pair(1, 0));
+// A sole waiter times out while posts arrive: it holds no post (result 1),
+// and the count comes back within waiters + 1 by dropping only what is
+// surplus. One post is kept for the next wait; of two, one is dropped. The
+// posts are made by other threads, which queue on the semaphore's mutex
+// (held here past the waiter's deadline) before the timed-out waiter does,
+// so they land first: the mutex hands itself over in arrival order.
+TEST_F(PalSemaphoreTest, AWaiterTimingOutDropsOnlySurplusPosts) {
+    for (int posts : {1, 2}) {
+        SCOPED_TRACE(posts);
+        std::atomic<uint32_t> result{99};
+        std::thread waiter([&] { result = PalSemaphoreWait(sem_, 300); });
+        AwaitWaiters(1);
+        pthread_mutex_lock(&sem_->mutex);
+        std::vector<std::thread> posters;
+        for (int i = 0; i < posts; ++i) posters.emplace_back([this] { PalSemaphorePost(sem_); });
+        std::this_thread::sleep_for(milliseconds(700));  // the waiter's deadline passes
+        pthread_mutex_unlock(&sem_->mutex);
+        for (auto& t : posters) t.join();
+        waiter.join();
+        EXPECT_EQ(result.load(), 1u);
+        EXPECT_EQ(Counters(), Pair(1, 0));
+        EXPECT_EQ(PalSemaphoreWait(sem_, 0), 0u);
+    }
 }
 
 // Timed on CLOCK_MONOTONIC: never early on it.

@@ -57,16 +57,30 @@ protected:
 
 // The harness's global clock is its monotonic clock plus the epoch offset.
 // With an offset of 100 s, a global deadline of 50 s lies 50 s before the
-// monotonic zero: due at the first pass, like any past deadline, and not
-// taken for a time far in the future.
+// monotonic zero, and one whose high word is 0xFFFFFFFF before the global
+// zero itself: both are due at the first pass, like any past deadline, and
+// neither is taken for a time far in the future.
 TEST_F(SchedulerGlobalNodes, ADeadlineBeforeTheMonotonicZeroIsPast) {
     gEngine.load()->SetEpochOffset(100);
     ASSERT_EQ(QueueGlobal(50 * kSecond), 0u);
+    ASSERT_EQ(QueueGlobal(0xFFFFFFFF00000005ull), 0u);
     ASSERT_EQ(QueueGlobal(200 * kSecond), 0u);  // 100 s monotonic: later
     EXPECT_EQ(h.timer->LastArmed(), 0u) << "a past deadline arms the timer at once";
     h.Pass();
-    EXPECT_EQ(Queued(), 1u) << "the past deadline was not fired";
+    EXPECT_EQ(Queued(), 1u) << "a past deadline was not fired";
     EXPECT_EQ(gNextDeadline.Load(), h.Now() + kMs) << "the later node is folded, the tick comes first";
+}
+
+// With the global clock 100 s behind the monotonic one, a global deadline
+// less than 100 s below NeverTime lies beyond the top of the range on the
+// monotonic clock: it reads as the latest time there, not as one whose high
+// word is 0xFFFFFFFF (which would be before every time, so at once).
+TEST_F(SchedulerGlobalNodes, ADeadlineBeyondTheMonotonicRangeIsTheLatest) {
+    gEngine.load()->SetEpochOffset(-100);
+    ASSERT_EQ(QueueGlobal(kNeverTime64 - 100 * kSecond + 6), 0u);
+    EXPECT_EQ(h.timer->armed.size(), 0u) << "a deadline centuries ahead was armed";
+    h.Pass();
+    EXPECT_EQ(Queued(), 1u) << "a deadline at the top of the range was fired";
 }
 
 // 127 global-clock nodes are queued with the kernel's conversion replaced by

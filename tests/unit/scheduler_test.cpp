@@ -50,6 +50,12 @@ protected:
         ClockTime d = FromU64(deadline);
         return InsertWaitNode(node, &d, cb, reinterpret_cast<void*>(static_cast<intptr_t>(tag)));
     }
+    // The controlled clock at `now`, the next tick one period ahead.
+    void MoveTo(uint64_t now) {
+        h.SetNow(now);
+        gNextTick.Store(now + kMs);
+        gNextDeadline.Store(now + kMs);
+    }
     std::vector<WaitNode*> ListOrder() {
         std::vector<WaitNode*> out;
         for (WaitNode* n = gWaitList.load(); n != nullptr; n = n->next.load()) out.push_back(n);
@@ -96,13 +102,17 @@ TEST_F(SchedulerTest, TickSerialCountsOnlyWhileRegistered) {
     EXPECT_EQ(gTicks, (std::vector<uint64_t>{0}));
 }
 
-TEST_F(SchedulerTest, BothCallbackTimesDueInOnePassCallTwiceMonotonicFirst) {
+// Both callback times due in one pass, each exactly at the pass's time (a
+// time equal to now is due): the callback is called twice. (The two calls
+// carry the same function, argument and now, so which comes first cannot be
+// told from outside.)
+TEST_F(SchedulerTest, BothCallbackTimesDueInOnePassCallTwice) {
     quelta_iTSC_SetCallback(RecordCallback, nullptr);
     ClockTime t = FromU64(h.Now() + 100);
     ASSERT_EQ(quelta_iTSC_SetCallbackTime(&t, 0), 1u);
     ASSERT_EQ(quelta_iTSC_SetCallbackTime(&t, -1), 1u);  // global == monotonic here
     EXPECT_EQ(h.timer->LastArmed(), ToU64(t));           // earlier than the tick: armed
-    h.SetNow(h.Now() + 200);
+    h.SetNow(ToU64(t));
     h.Pass();
     ASSERT_EQ(gCalls.size(), 2u);
     // With no argument set, the callback receives the pass's own `now`.
@@ -185,23 +195,29 @@ TEST_F(SchedulerTest, CallbackTimeWithoutTimerIsRefusedOnlyWhenItWouldArm) {
     EXPECT_EQ(gMonotonicCallbackTime.Load(), ToU64(late));
 }
 
+// Three equal deadlines queued into an empty list, one earlier and one later:
+// a pass exactly at the equal deadline finds them due (a deadline equal to
+// now is due) and fires them in list order, the equal ones in the order they
+// arrived; the later one stays and is folded into the arming.
 TEST_F(SchedulerTest, ExpiredNodesFireInListOrderAndTheNextIsFolded) {
     const uint64_t now = h.Now();
+    WaitNode* x = h.Take();
+    WaitNode* y = h.Take();
+    WaitNode* z = h.Take();
     WaitNode* a = h.Take();
-    WaitNode* b = h.Take();
-    WaitNode* c = h.Take();
     WaitNode* d = h.Take();
-    ASSERT_EQ(Queue(c, now + 300, 3), 0u);
-    ASSERT_EQ(Queue(a, now + 100, 1), 0u);
-    ASSERT_EQ(Queue(b, now + 300, 2), 0u);  // same deadline as c, queued after it
-    ASSERT_EQ(Queue(d, now + 600000, 4), 0u);
-    EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{a, c, b, d}));
-    h.SetNow(now + 500);
+    ASSERT_EQ(Queue(x, now + 300, 1), 0u);
+    ASSERT_EQ(Queue(y, now + 300, 2), 0u);
+    ASSERT_EQ(Queue(z, now + 300, 3), 0u);
+    ASSERT_EQ(Queue(a, now + 100, 4), 0u);
+    ASSERT_EQ(Queue(d, now + 600000, 5), 0u);
+    EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{a, x, y, z, d}));
+    h.SetNow(now + 300);
     h.Pass();
-    EXPECT_EQ(gFired, (std::vector<int>{1, 3, 2}));
+    EXPECT_EQ(gFired, (std::vector<int>{4, 1, 2, 3}));
     EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{d}));
     EXPECT_EQ(h.timer->LastArmed(), now + 600000);  // earlier than the next tick
-    for (WaitNode* n : {a, b, c}) {
+    for (WaitNode* n : {x, y, z, a}) {
         EXPECT_EQ(n->fireCount.load(), 1u);
         EXPECT_EQ(n->state.load(), static_cast<uint32_t>(NodeState::kFired));
         ReleaseWaitNode(n);
@@ -254,6 +270,9 @@ TEST_F(SchedulerTest, InsertArmsOnlyForANewEarliestDeadline) {
     WaitNode* first = h.Take();
     Queue(first, 0xFFFFFFFF00000000ull, 3);  // high word 0xFFFFFFFF: before every time
     EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{first, early, late, never}));
+    // Armed as already past, not for a time decades ahead.
+    EXPECT_EQ(h.timer->LastArmed(), 0u);
+    EXPECT_EQ(h.timer->expireNowCalls, 0);
     h.Pass();  // fires at the next pass
     EXPECT_EQ(gFired, (std::vector<int>{3}));
 }
@@ -271,7 +290,11 @@ TEST_F(SchedulerTest, InsertWithoutTimerIsRefusedAndLeavesTheListAlone) {
     autoNode->autoRelease.store(1);
     EXPECT_EQ(Queue(autoNode, now + 100, 3), 1u);
     EXPECT_EQ(gFreeList.load(), autoNode);  // straight back to the pool
+    WaitNode* behind = h.Take();  // would not be the earliest: refused all the same
+    behind->autoRelease.store(0);
+    EXPECT_EQ(Queue(behind, now + 900000, 4), 1u);
     EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{queued}));
+    ReleaseWaitNode(behind);
     ReleaseWaitNode(held);
     ReleaseWaitNode(queued);
     uint32_t freeCount = 0;
@@ -317,6 +340,101 @@ TEST_F(SchedulerTest, TickCallbackRegistrationAndControlFlag) {
     EXPECT_EQ(gControlFlag.load(), 1u);
     e->SetControlFlag(2);
     EXPECT_EQ(gControlFlag.load(), 0u);
+}
+
+// NeverTime is one value: a time whose low word alone is 0xFFFFFFFF, or whose
+// high word alone is 0xFFFFFFFE, is an ordinary time, armed for (not expired
+// at once) and fired like any other; so is a tick in that range.
+TEST_F(SchedulerTest, NeverTimeIsRecognisedOnlyWhenBothWordsMatch) {
+    for (uint64_t t : {0x00000005FFFFFFFFull, 0xFFFFFFFE00000005ull}) {
+        SCOPED_TRACE(t);
+        gFired.clear();
+        MoveTo(t - 400000);
+        h.Pass();
+        EXPECT_EQ(h.timer->LastArmed(), t + 600000) << "the next tick was not armed";
+        const int expiredAtOnce = h.timer->expireNowCalls;
+        WaitNode* n = h.Take();
+        ASSERT_EQ(Queue(n, t, 7), 0u);
+        EXPECT_EQ(h.timer->LastArmed(), t);
+        EXPECT_EQ(h.timer->expireNowCalls, expiredAtOnce);
+        h.SetNow(t);
+        h.Pass();
+        EXPECT_EQ(gFired, std::vector<int>{7});
+        ReleaseWaitNode(n);
+    }
+}
+
+// A NeverTime global callback time is no time: it is neither converted to
+// the monotonic clock nor folded into the next arming. With an epoch offset
+// of 100 s, NeverTime taken for a time would read as one 100 s before it on
+// the monotonic clock; the clock stands just before that here, so such a
+// time would be armed ahead of the next tick.
+TEST_F(SchedulerTest, NeverTimeGlobalCallbackTimeIsNeitherConvertedNorFolded) {
+    gEngine.load()->SetEpochOffset(100);
+    MoveTo(kNeverTime64 - 100 * 1000 * kMs - 400000);
+    quelta_iTSC_SetCallback(RecordCallback, nullptr);
+    const size_t armed = h.timer->armed.size();
+    const ClockTime never = kNeverTime;
+    EXPECT_EQ(quelta_iTSC_SetCallbackTime(&never, -1), 1u);
+    EXPECT_EQ(h.timer->armed.size(), armed) << "armed for a cancelled callback time";
+    EXPECT_TRUE(IsNever(gGlobalCallbackTime.Load()));
+    h.Pass();
+    EXPECT_EQ(h.timer->LastArmed(), h.Now() + kMs) << "a cancelled callback time was folded";
+    EXPECT_TRUE(gCalls.empty());
+}
+
+// The jitter samples fill an array of 1000: the last sample goes to index
+// 999; a count at the end, or below 0, records nothing, and nothing is ever
+// written beside the array (the statistics fields just before and after it).
+TEST_F(SchedulerTest, JitterSamplesStayInsideTheirArray) {
+    auto* engine = gEngine.load();
+    engine->stats.globalReadExtra.store(0x5A5A5A5Au);
+    engine->stats.rawReadSamples[0].store(0xA5A5A5A5u);
+    engine->statsEnabled.store(1);
+    for (int32_t count : {999, 1000, -1}) {
+        engine->statsCount.store(count);
+        h.SetNow(gNextTick.Load() + 123);
+        h.Pass();
+        EXPECT_EQ(engine->statsCount.load(), count == 999 ? 1000 : count);
+    }
+    EXPECT_EQ(engine->stats.jitterSamples[999].load(), 123u);
+    EXPECT_EQ(engine->stats.rawReadSamples[0].load(), 0xA5A5A5A5u);
+    EXPECT_EQ(engine->stats.globalReadExtra.load(), 0x5A5A5A5Au);
+}
+
+// A new generation of the global clock (no operation of the library makes
+// one; the test stores it) fires every abortable global-clock node at once,
+// whatever its deadline. A global node that is not abortable and an
+// abortable monotonic one stay queued. The change is seen once: a node
+// queued after it is not fired by the passes that follow.
+TEST_F(SchedulerTest, ANewGenerationFiresOnlyAbortableGlobalNodesOnce) {
+    const uint32_t saved = gGeneration.load();
+    h.Pass();  // the routine's first pass notes the generation
+    const uint64_t far = h.Now() + 3600 * 1000 * kMs;
+    auto queue = [&](uint32_t isGlobal, uint8_t abortable, int tag) {
+        WaitNode* n = h.Take();
+        n->isGlobal.store(isGlobal);
+        n->abortable.store(abortable);
+        EXPECT_EQ(Queue(n, far, tag), 0u);
+        return n;
+    };
+    WaitNode* aborted = queue(1, 1, 1);
+    WaitNode* global = queue(1, 0, 2);
+    WaitNode* monotonic = queue(0, 1, 3);
+    gGeneration.store(saved + 1);
+    h.SetNow(h.Now() + 1000);
+    h.Pass();
+    EXPECT_EQ(gFired, std::vector<int>{1});
+    WaitNode* later = queue(1, 1, 4);
+    h.SetNow(h.Now() + 1000);
+    h.Pass();
+    EXPECT_EQ(gFired, std::vector<int>{1}) << "an old change of generation fired a new wait";
+    EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{global, monotonic, later}));
+    for (WaitNode* n : {aborted, global, monotonic, later}) ReleaseWaitNode(n);
+    gGeneration.store(saved);
+    uint32_t freeCount = 0;
+    EXPECT_TRUE(AuditWaitNodes(&freeCount, nullptr, nullptr));
+    EXPECT_EQ(freeCount, kWaitNodeCount);
 }
 
 }  // namespace

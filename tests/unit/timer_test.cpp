@@ -167,10 +167,24 @@ TEST_F(WakeFixture, DispatchAndWhatTheStandInRefuses) {
 
 // --- slots without a thread ---------------------------------------------------
 
-TEST(TimerSlots, WithoutAThreadSetExpiryOnlyStoresAndDestructionJoinsNothing) {
-    std::unique_ptr<Timer> timer(new Timer());
+std::atomic<int> gAlarms{0};
+void CountAlarm(int) { gAlarms.fetch_add(1); }
+
+// A timer that was never initialised has no thread: SetExpiry and ExpireNow
+// only store the expiry (32-bit seconds and nanoseconds) and wake nobody, and
+// destroying it is prompt and quiet: no thread started or joined, no signal
+// sent, the process's SIGALRM action left as it was.
+TEST(TimerSlots, WithoutAThreadSetExpiryOnlyStoresAndDestructionIsQuiet) {
+    struct sigaction counting {}, saved {}, after {};
+    counting.sa_handler = &CountAlarm;
+    sigemptyset(&counting.sa_mask);
+    sigaction(SIGALRM, &counting, &saved);
+    gAlarms.store(0);
+    const int threads = testsupport::CountThreads();
+
+    Timer* timer = new Timer();
     EXPECT_EQ(timer->GetTicksPerMicrosecond(), 1000u);
-    // 32-bit seconds and nanoseconds.
+    const uint32_t word = PalWakeSnapshot(timer->state.wakeWord);
     const uint64_t when = 0x123456789ABCDEFull;
     timer->SetExpiry(ClockTime{static_cast<uint32_t>(when), static_cast<uint32_t>(when >> 32)});
     EXPECT_EQ(timer->state.expiry.tv_sec, static_cast<int32_t>(static_cast<uint32_t>(when / 1000000000ull)));
@@ -178,6 +192,16 @@ TEST(TimerSlots, WithoutAThreadSetExpiryOnlyStoresAndDestructionJoinsNothing) {
     timer->ExpireNow();
     EXPECT_EQ(timer->state.expiry.tv_sec, 0);
     EXPECT_EQ(timer->state.expiry.tv_nsec, 0);
+    EXPECT_EQ(PalWakeSnapshot(timer->state.wakeWord), word) << "woke a thread that does not exist";
+    EXPECT_EQ(testsupport::CountThreads(), threads);
+
+    const uint64_t t0 = MonoNowNs();
+    delete timer;
+    EXPECT_LT(MonoNowNs() - t0, 50 * kMs);
+    EXPECT_EQ(gAlarms.load(), 0);
+    sigaction(SIGALRM, &saved, &after);
+    EXPECT_EQ(after.sa_handler, &CountAlarm) << "the destruction changed the SIGALRM action";
+    EXPECT_EQ(testsupport::CountThreads(), threads);
 }
 
 // --- a timer without real-time privilege ------------------------------------

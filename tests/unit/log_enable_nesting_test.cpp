@@ -1,0 +1,60 @@
+// The log's nested switch, AdjustEnabled (log slot 12), used by several
+// threads at once: recording stays on while the sum of all adjustments is
+// above 0, so no adjustment may be lost when threads adjust together.
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <thread>
+#include <vector>
+
+#include "engine/ClockTimeOps.h"
+#include "log/tKPLogEngine.h"
+
+using namespace quelta;  // the engine class, wherever its namespace
+
+namespace {
+
+// True when the engine records: an entry of its own (a new time and event)
+// is logged and looked for among the newest entries read back. The read-out
+// puts the CPU into bits 8-15 of each event, so the events leave them 0.
+bool Records(iKPLogEngine* log) {
+    static uint32_t probe = 0;
+    ++probe;
+    const uint32_t event = probe << 16;
+    log->LogAt1(FromU64(1000000 + probe), event);
+    uint32_t low[64], high[64], events[64];
+    uint32_t count = 64;
+    log->ReadOutMerged(count, low, high, events, nullptr, 0);
+    for (uint32_t i = 0; i < count; ++i) {
+        if ((events[i] & ~0xFF00u) == event) return true;
+    }
+    return false;
+}
+
+TEST(LogEnableNesting, AdjustmentsFromManyThreadsAreAllCounted) {
+    iKPLogEngine* log = tKPLogEngine::Create();
+    ASSERT_NE(log, nullptr);
+    constexpr int kThreads = 4, kEach = 50000;
+    std::atomic<int> ready{0};
+    std::vector<std::thread> threads;
+    for (int t = 0; t < kThreads; ++t) {
+        threads.emplace_back([log, &ready] {
+            ready.fetch_add(1);
+            while (ready.load() < kThreads) std::this_thread::yield();  // all start together
+            for (int i = 0; i < kEach; ++i) {
+                log->AdjustEnabled(+2);
+                log->AdjustEnabled(-1);
+            }
+        });
+    }
+    for (auto& t : threads) t.join();
+    // The sum is kThreads * kEach: one less than that keeps recording on,
+    // the last one switches it off.
+    log->AdjustEnabled(-(kThreads * kEach - 1));
+    EXPECT_TRUE(Records(log)) << "adjustments made at the same time were lost";
+    log->AdjustEnabled(-1);
+    EXPECT_FALSE(Records(log)) << "recording on after the last adjustment took the sum to 0";
+    delete log;
+}
+
+}  // namespace
