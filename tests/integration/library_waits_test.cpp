@@ -195,8 +195,7 @@ TEST_F(LibraryWaits, MonotonicCallbackTimeFiresNotBeforeItsTime) {
         engine()->ReadMonotonic0(now);
         const ClockTime when = CT(U64(now) + delay);
         ASSERT_EQ(api().SetCallbackTime(&when, 0), 1u);
-        const uint64_t giveUp = MonoNowNs() + 2000 * kMs;
-        while (gCallbackAt.load() == 0 && MonoNowNs() < giveUp) api().WaitMicroSeconds(200);
+        testsupport::AwaitNonZero(gCallbackAt, 2000 * kMs);
         ASSERT_NE(gCallbackAt.load(), 0u);
         EXPECT_GE(gCallbackAt.load(), U64(when));
     }

@@ -99,9 +99,7 @@ TEST_F(WallClockStep, GlobalCallbackTimeMovesWithTheStep) {
     const uint64_t start = testsupport::MonoNowNs();
     PalSleepMilliseconds(10);
     gWallStep = 50 * kMs;  // the callback is now due 20 ms from here
-    while (gFiredGlobal.load() == 0 && testsupport::MonoNowNs() - start < 2000u * kMs) {
-        PalSleepMilliseconds(1);
-    }
+    testsupport::AwaitNonZero(gFiredGlobal, 2000u * kMs);
     const uint64_t took = testsupport::MonoNowNs() - start;
     ASSERT_NE(gFiredGlobal.load(), 0u);
     EXPECT_GE(gFiredGlobal.load(), ToU64(when));  // never before the wall clock shows it

@@ -15,6 +15,13 @@ static uint64_t Now(clockid_t id) {
 uint64_t MonoNowNs() { return Now(CLOCK_MONOTONIC); }
 uint64_t RealNowNs() { return Now(CLOCK_REALTIME); }
 
+uint64_t AwaitNonZero(const std::atomic<uint64_t>& word, uint64_t limitNs) {
+    const uint64_t start = MonoNowNs();
+    const timespec ms{0, 1000000};
+    while (word.load() == 0 && MonoNowNs() - start < limitNs) nanosleep(&ms, nullptr);
+    return word.load();
+}
+
 bool CanUseRealtime() {
     int policy = 0;
     sched_param old{};

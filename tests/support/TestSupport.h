@@ -4,6 +4,7 @@
 
 #include <time.h>
 
+#include <atomic>
 #include <cstdint>
 
 namespace testsupport {
@@ -11,6 +12,11 @@ namespace testsupport {
 // CLOCK_MONOTONIC / CLOCK_REALTIME now, in nanoseconds.
 uint64_t MonoNowNs();
 uint64_t RealNowNs();
+
+// Polls `word` every millisecond until it is not zero or `limitNs` have
+// passed; returns what it holds then (0: never set). For callbacks that
+// record when they ran.
+uint64_t AwaitNonZero(const std::atomic<uint64_t>& word, uint64_t limitNs);
 
 // True when the calling process may use SCHED_FIFO (tests that need it skip
 // otherwise, saying why).
