@@ -7,6 +7,7 @@
 
 #include <cstring>
 #include <memory>
+#include <string>
 #include <thread>
 
 #include "log_test_helpers.h"
@@ -44,36 +45,55 @@ long FaultsRecordingOn(iKPLogEngine* log, int32_t cpu, uint32_t records) {
 }
 
 // 12,000 records on every CPU (each 5000-entry ring wraps twice) must fault
-// nothing, in both banks and after a Configure to new, larger rings.
+// nothing, in both banks and after a Configure to new, larger rings. Under an
+// emulator the emulator's own work (translating code, growing its caches) is
+// counted as the thread's faults now and then; a ring that is not written
+// through faults on every fresh engine, so a clean run out of three decides.
 TEST(LogFaults, RecordingOnFreshRingsTakesNoPageFault) {
 #if defined(__SANITIZE_THREAD__)
     GTEST_SKIP() << "ThreadSanitizer writes its own per-thread trace on every access, faulting in pages";
 #endif
     ASSERT_EQ(quelta::PalInitialize(), 1u);
     const int32_t cpus = quelta::PalGetCpuCount();
-    std::unique_ptr<iKPLogEngine> log(tKPLogEngine::Create());
-    ASSERT_NE(log, nullptr);
     constexpr uint32_t kRecords = 12000;
-
-    auto expectNoFaults = [&](const char* what) {
+    {
+        std::unique_ptr<iKPLogEngine> probe(tKPLogEngine::Create());
+        ASSERT_NE(probe, nullptr);
         for (int32_t cpu = 0; cpu < cpus; ++cpu) {
-            EXPECT_EQ(FaultsRecordingOn(log.get(), cpu, kRecords), 0) << what << ", CPU " << cpu;
+            if (FaultsRecordingOn(probe.get(), cpu, 0) < 0) GTEST_SKIP() << "cannot pin a thread to CPU " << cpu;
         }
-    };
-    for (int32_t cpu = 0; cpu < cpus; ++cpu) {
-        if (FaultsRecordingOn(log.get(), cpu, 0) < 0) GTEST_SKIP() << "cannot pin a thread to CPU " << cpu;
     }
-    log->SetEnabled(1);
-    expectNoFaults("fresh engine");
 
-    uint32_t none = 0;  // a read-out of 0 entries leaves the other bank active
-    log->ReadOut7(none, nullptr, nullptr, nullptr, 0);
-    expectNoFaults("second bank");
-
-    ASSERT_EQ(log->Configure(20000), 20000u);  // 400 kB rings: fresh mappings
-    log->SetEnabled(1);
-    expectNoFaults("after Configure");
-    EXPECT_EQ(Held(log.get()), 100u);
+    // One fresh engine through all three phases; what faulted, or "".
+    auto faultsOnAFreshEngine = [&]() -> std::string {
+        std::unique_ptr<iKPLogEngine> log(tKPLogEngine::Create());
+        if (log == nullptr) return "no engine";
+        std::string faulted;
+        auto record = [&](const char* what) {
+            for (int32_t cpu = 0; cpu < cpus; ++cpu) {
+                const long faults = FaultsRecordingOn(log.get(), cpu, kRecords);
+                if (faults != 0) {
+                    faulted += std::string(what) + ", CPU " + std::to_string(cpu) + ": " + std::to_string(faults) + "; ";
+                }
+            }
+        };
+        log->SetEnabled(1);
+        record("fresh engine");
+        uint32_t none = 0;  // a read-out of 0 entries leaves the other bank active
+        log->ReadOut7(none, nullptr, nullptr, nullptr, 0);
+        record("second bank");
+        if (log->Configure(20000) != 20000u) return "Configure(20000) refused";  // 400 kB rings: fresh mappings
+        log->SetEnabled(1);
+        record("after Configure");
+        if (Held(log.get()) != 100u) faulted += "held " + std::to_string(Held(log.get())) + " entries, not 100; ";
+        return faulted;
+    };
+    std::string faulted;
+    for (int attempt = 0; attempt < 3; ++attempt) {
+        faulted = faultsOnAFreshEngine();
+        if (faulted.empty()) break;
+    }
+    EXPECT_EQ(faulted, "") << "minor faults while recording, in each of three fresh engines";
 }
 
 }  // namespace
