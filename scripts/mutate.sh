@@ -198,7 +198,10 @@ if [ $check_only = 1 ]; then echo "$total mutants, all apply"; exit 0; fi
 mkdir -p "$work"
 rm -rf "$work/src" "$work/logs"
 mkdir -p "$work/src" "$work/logs"
-tar -C "$root" --exclude=./build --exclude=./.git -cf - . | tar -C "$work/src" -xf -
+# Extracted with the time of extraction (-m), so that a build left behind by an
+# interrupted run, made from a mutated file, is older than every file of the
+# copy and is rebuilt, never taken as current.
+tar -C "$root" --exclude=./build --exclude=./.git -cf - . | tar -C "$work/src" -xmf -
 current=""  # the file of the copy that carries a mutant right now
 restore() {
   if [ -n "$current" ]; then cp "$work/original" "$work/src/$current"; current=""; fi
