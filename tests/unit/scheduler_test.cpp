@@ -122,12 +122,17 @@ TEST_F(SchedulerTest, BothCallbackTimesDueInOnePassCallTwice) {
     EXPECT_TRUE(IsNever(gGlobalCallbackTime.Load()));
 }
 
-TEST_F(SchedulerTest, CallbackTimeLaterThanTheTickIsFoldedAndArmedExactly) {
+// A callback time between ticks, several ticks ahead, is stored without
+// arming; each pass folds it into the next deadline, so the pass before it
+// arms the timer for the time itself, not for the tick after it. `clock` 0 is
+// the monotonic callback time, -1 the global one (global == monotonic here).
+void ExpectFoldedAndArmedExactly(SchedulerHarness& h, int32_t clock) {
+    SCOPED_TRACE(clock == 0 ? "monotonic callback time" : "global callback time");
     quelta_iTSC_SetCallback(RecordCallback, nullptr);
     const uint64_t when = h.Now() + 5 * kMs + 300000;  // between ticks, 5 ms ahead
     ClockTime t = FromU64(when);
     const size_t armedBefore = h.timer->armed.size();
-    ASSERT_EQ(quelta_iTSC_SetCallbackTime(&t, 0), 1u);
+    ASSERT_EQ(quelta_iTSC_SetCallbackTime(&t, clock), 1u);
     EXPECT_EQ(h.timer->armed.size(), armedBefore);  // stored without arming
     // Ticks until the pass before it: that pass arms for the callback time itself.
     while (gNextTick.Load() + kMs <= when) {
@@ -141,6 +146,14 @@ TEST_F(SchedulerTest, CallbackTimeLaterThanTheTickIsFoldedAndArmedExactly) {
     h.SetNow(when);
     h.Pass();
     EXPECT_EQ(gCalls.size(), 1u);
+}
+
+TEST_F(SchedulerTest, MonotonicCallbackTimeLaterThanTheTickIsFoldedAndArmedExactly) {
+    ExpectFoldedAndArmedExactly(h, 0);
+}
+
+TEST_F(SchedulerTest, GlobalCallbackTimeLaterThanTheTickIsFoldedAndArmedExactly) {
+    ExpectFoldedAndArmedExactly(h, -1);
 }
 
 void ReArmingCallback(void* arg) {
