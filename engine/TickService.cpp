@@ -160,13 +160,13 @@ void TickServiceRoutine() {
             }
 
             // Abortable global-clock waits end when the clock's generation
-            // moved; then the expired heads, in list order.
+            // moved; then every expired node, in list order.
             const uint32_t generation = gGeneration.load(kRelaxed);
             if (generation != sLastGeneration.load(kRelaxed)) {
                 sLastGeneration.store(generation, kRelaxed);
                 work.fired = DetachAbortableGlobalNodesLocked(work.batch, kWaitNodeCount);
             }
-            work.fired += DetachDueHeadsLocked(now, offset, work.batch + work.fired, kWaitNodeCount - work.fired);
+            work.fired += DetachDueNodesLocked(now, offset, work.batch + work.fired, kWaitNodeCount - work.fired);
 
             const bool tickCallback = work.tickDue && gTickCallback.load(kRelaxed) != nullptr;
             if (!work.callMonotonic && !work.callGlobal && work.fired == 0 && !tickCallback && !work.repeat) {

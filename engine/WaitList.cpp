@@ -101,18 +101,28 @@ bool NeedsTimer(const WaitNode* node, uint64_t effective) {
     return self == 0 || Earlier(effective + kSelfWakeSlackNs, self);
 }
 
-// The earliest deadline among the queued nodes that need the timer thread:
-// the head's, unless its holder wakes by itself; then the first node behind
-// it that needs the timer. Lock held.
+// Whether the list's order can differ from the deadlines' order. Each node
+// is placed by its deadline at its insert, a global-clock node at that
+// moment's offset; a step of the wall clock since then moves every global
+// deadline at once, so with global nodes queued the order may be stale and
+// no search can stop at the first node. Lock held.
+bool OrderMayBeStale() { return gQueuedGlobalNodes.load(kRelaxed) != 0; }
+
+// The earliest deadline among the queued nodes that need the timer thread
+// (a holder that wakes by itself does not). With monotonic nodes only, the
+// first such node in list order; otherwise every node is looked at (at most
+// the pool's 128, a comparison each). Lock held.
 bool EarliestNeedingTimer(int64_t offset, uint64_t& out) {
+    const bool whole = OrderMayBeStale();
+    bool found = false;
     for (WaitNode* n = gWaitList.load(kRelaxed); n != nullptr; n = n->next.load(kRelaxed)) {
         const uint64_t effective = EffectiveDeadline(n, offset);
-        if (NeedsTimer(n, effective)) {
-            out = effective;
-            return true;
-        }
+        if (!NeedsTimer(n, effective)) continue;
+        if (!found || Earlier(effective, out)) out = effective;
+        found = true;
+        if (!whole) break;
     }
-    return false;
+    return found;
 }
 
 // On the timer thread, in a callback. Lock held (the timer cannot go away).
@@ -287,15 +297,17 @@ uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
         if (TimerServing()) {
             LinkSorted(node, offset);
             queued = true;
-            if (gWaitList.load(kRelaxed) == node) {
-                const uint64_t effective = EffectiveDeadline(node, offset);
-                if (NeedsTimer(node, effective) && Earlier(effective, gNextDeadline.Load())) {
-                    gNextDeadline.Store(effective);
-                    if (ArmTimer(FromU64(effective)) == 0) {
-                        queued = false;
-                        UnlinkQueued(node);
-                        node->state.store(static_cast<uint32_t>(NodeState::kHeld), kRelaxed);
-                    }
+            // Armed for whenever it is earlier than the armed time, head or
+            // not: a head whose holder wakes by itself left the timer for
+            // the tick, and after a wall-clock step the head need not be
+            // the earliest.
+            const uint64_t effective = EffectiveDeadline(node, offset);
+            if (NeedsTimer(node, effective) && Earlier(effective, gNextDeadline.Load())) {
+                gNextDeadline.Store(effective);
+                if (ArmTimer(FromU64(effective)) == 0) {
+                    queued = false;
+                    UnlinkQueued(node);
+                    node->state.store(static_cast<uint32_t>(NodeState::kHeld), kRelaxed);
                 }
             }
         }
@@ -393,24 +405,30 @@ void FireWaitNode(WaitNode* node) {
     SettleFiringLocked(node, release);
 }
 
-uint32_t DetachDueHeadsLocked(uint64_t now, int64_t offset, WaitNode** batch, uint32_t room) {
+uint32_t DetachDueNodesLocked(uint64_t now, int64_t offset, WaitNode** batch, uint32_t room) {
+    const bool whole = OrderMayBeStale();
     uint32_t n = 0;
-    while (WaitNode* head = gWaitList.load(kRelaxed)) {
-        const uint64_t effective = EffectiveDeadline(head, offset);
-        if (!Due(effective, now) || n == room) {
-            // The rest stays queued: fold the earliest deadline that needs
-            // the timer thread into the next arming.
-            uint64_t earliest;
-            if (EarliestNeedingTimer(offset, earliest) && Earlier(earliest, gNextDeadline.Load())) {
-                gNextDeadline.Store(earliest);
-            }
-            break;
+    WaitNode* node = gWaitList.load(kRelaxed);
+    while (node != nullptr && n < room) {
+        WaitNode* next = node->next.load(kRelaxed);
+        if (!Due(EffectiveDeadline(node, offset), now)) {
+            if (!whole) break;  // in order: nothing behind it is due either
+            node = next;
+            continue;
         }
-        DetachForFiring(head);
+        DetachForFiring(node);
         // A holder whose own wake has come needs no post: it is waking.
-        const uint64_t self = head->selfWakeAt.load(kRelaxed);
-        if (self != 0 && Due(self, now)) head->postOnFire.store(0, kRelaxed);
-        batch[n++] = head;
+        const uint64_t self = node->selfWakeAt.load(kRelaxed);
+        if (self != 0 && Due(self, now)) node->postOnFire.store(0, kRelaxed);
+        batch[n++] = node;
+        node = next;
+    }
+    // What stays queued: its earliest deadline that needs the timer thread
+    // goes into the next arming (if the batch was full, that is a past one,
+    // and the next pass comes at once).
+    uint64_t earliest;
+    if (EarliestNeedingTimer(offset, earliest) && Earlier(earliest, gNextDeadline.Load())) {
+        gNextDeadline.Store(earliest);
     }
     return n;
 }

@@ -145,11 +145,12 @@ void FireWaitNode(WaitNode* node);  // tick service only
 
 // Tick service helpers. With the lock held, the pass takes the nodes it is
 // to fire off the wait list (marked firing): every abortable global-clock
-// node, or the due heads (global ones at `offset`) in list order, folding the
-// first head that is not due into gNextDeadline. Each returns how many it put
-// into `batch` (room for `room`).
+// node, or every due node (global ones at `offset`) in list order, wherever
+// it stands (a wall-clock step can leave a due global node behind one that is
+// not), folding the earliest remaining deadline that needs the timer into
+// gNextDeadline. Each returns how many it put into `batch` (room for `room`).
 uint32_t DetachAbortableGlobalNodesLocked(WaitNode** batch, uint32_t room);
-uint32_t DetachDueHeadsLocked(uint64_t now, int64_t offset, WaitNode** batch, uint32_t room);
+uint32_t DetachDueNodesLocked(uint64_t now, int64_t offset, WaitNode** batch, uint32_t room);
 // Without the lock: posts the node's semaphore and runs its callback; returns
 // the release decision, to be settled with the lock held.
 uint32_t RunFiring(WaitNode* node);

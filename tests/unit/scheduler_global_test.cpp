@@ -161,4 +161,71 @@ TEST_F(SchedulerGlobalNodes, AWaiterThatWakesByItselfCostsTheTimerThreadNothing)
     PalSemaphoreDestroy(semaphore);
 }
 
+// A node that needs the timer is armed for even when it is not the head: a
+// head whose waiter wakes by itself leaves the timer unarmed, so a callback
+// queued behind it would otherwise wait for the next tick.
+TEST_F(SchedulerGlobalNodes, ANodeBehindASelfWakingHeadIsArmedFor) {
+    WaitNode* head = h.Take();
+    head->isGlobal.store(1);
+    head->autoRelease.store(1);
+    head->selfWakeAt.store(h.Now() + 400 * 1000);
+    const ClockTime headAt = FromU64(h.Now() + 400 * 1000);
+    ASSERT_EQ(InsertWaitNode(head, &headAt, nullptr, nullptr), 0u);
+    ASSERT_EQ(h.timer->LastArmed(), kNeverTime64);
+
+    WaitNode* behind = h.Take();
+    behind->autoRelease.store(1);
+    const uint64_t behindAt = h.Now() + 600 * 1000;
+    const ClockTime at = FromU64(behindAt);
+    ASSERT_EQ(InsertWaitNode(behind, &at, nullptr, nullptr), 0u);
+    ASSERT_EQ(gWaitList.load(), head);
+    EXPECT_EQ(h.timer->LastArmed(), behindAt) << "the callback behind the head waits for the next tick";
+}
+
+// A step of the wall clock moves every global deadline at once, so the list's
+// order, made before the step, no longer holds: a pass fires every node that
+// is due wherever it stands, and never arms the timer for a time already past
+// (which would make the timer thread spin until the stale head came due).
+TEST_F(SchedulerGlobalNodes, AfterAWallClockStepEveryDueNodeFiresWhereverItStands) {
+    // Stepped back: a global head now 1 s later than the monotonic node behind it.
+    WaitNode* global = h.Take();
+    global->isGlobal.store(1);
+    global->autoRelease.store(1);
+    global->selfWakeAt.store(h.Now() + 400 * 1000);
+    const ClockTime globalAt = FromU64(h.Now() + 400 * 1000);
+    ASSERT_EQ(InsertWaitNode(global, &globalAt, nullptr, nullptr), 0u);
+    WaitNode* monotonic = h.Take();
+    monotonic->autoRelease.store(1);
+    const ClockTime monotonicAt = FromU64(h.Now() + 600 * 1000);
+    ASSERT_EQ(InsertWaitNode(monotonic, &monotonicAt, nullptr, nullptr), 0u);
+    gEngine.load()->SetEpochOffset(-1);
+    h.SetNow(h.Now() + 700 * 1000);
+    h.Pass();
+    EXPECT_NE(monotonic->fireCount.load(), 0u) << "a due node behind a stepped head did not fire";
+    EXPECT_EQ(global->fireCount.load(), 0u) << "fired 1 s early";
+    EXPECT_FALSE(Earlier(h.timer->LastArmed(), h.Now())) << "armed for a time already past";
+    gEngine.load()->SetEpochOffset(0);
+    h.SetNow(h.Now() + 1000);
+    h.Pass();
+    EXPECT_NE(global->fireCount.load(), 0u);
+
+    // Stepped forward: a global node behind a monotonic one is due first.
+    WaitNode* first = h.Take();
+    first->autoRelease.store(1);
+    const ClockTime firstAt = FromU64(h.Now() + 2 * kSecond);
+    ASSERT_EQ(InsertWaitNode(first, &firstAt, nullptr, nullptr), 0u);
+    WaitNode* stepped = h.Take();
+    stepped->isGlobal.store(1);
+    stepped->autoRelease.store(1);
+    const ClockTime steppedAt = FromU64(h.Now() + 3 * kSecond);
+    ASSERT_EQ(InsertWaitNode(stepped, &steppedAt, nullptr, nullptr), 0u);
+    ASSERT_EQ(gWaitList.load(), first);
+    gEngine.load()->SetEpochOffset(2);  // its deadline is now 1 s ahead
+    h.SetNow(h.Now() + 1500 * kMs);
+    h.Pass();
+    EXPECT_NE(stepped->fireCount.load(), 0u) << "a stepped global node waited for the node before it";
+    EXPECT_EQ(first->fireCount.load(), 0u);
+    gEngine.load()->SetEpochOffset(0);
+}
+
 }  // namespace
