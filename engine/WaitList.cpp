@@ -408,11 +408,20 @@ void FireWaitNode(WaitNode* node) {
 uint32_t DetachDueNodesLocked(uint64_t now, int64_t offset, WaitNode** batch, uint32_t room) {
     const bool whole = OrderMayBeStale();
     uint32_t n = 0;
+    // With the whole list walked, the earliest of what stays queued is
+    // found on the way: one walk under the lock, not two.
+    bool seen = false;
+    uint64_t earliest = 0;
     WaitNode* node = gWaitList.load(kRelaxed);
     while (node != nullptr && n < room) {
         WaitNode* next = node->next.load(kRelaxed);
-        if (!Due(EffectiveDeadline(node, offset), now)) {
+        const uint64_t effective = EffectiveDeadline(node, offset);
+        if (!Due(effective, now)) {
             if (!whole) break;  // in order: nothing behind it is due either
+            if (NeedsTimer(node, effective) && (!seen || Earlier(effective, earliest))) {
+                earliest = effective;
+                seen = true;
+            }
             node = next;
             continue;
         }
@@ -426,10 +435,8 @@ uint32_t DetachDueNodesLocked(uint64_t now, int64_t offset, WaitNode** batch, ui
     // What stays queued: its earliest deadline that needs the timer thread
     // goes into the next arming (if the batch was full, that is a past one,
     // and the next pass comes at once).
-    uint64_t earliest;
-    if (EarliestNeedingTimer(offset, earliest) && Earlier(earliest, gNextDeadline.Load())) {
-        gNextDeadline.Store(earliest);
-    }
+    if (!whole || node != nullptr) seen = EarliestNeedingTimer(offset, earliest);
+    if (seen && Earlier(earliest, gNextDeadline.Load())) gNextDeadline.Store(earliest);
     return n;
 }
 

@@ -67,14 +67,15 @@ tick.global-callback-lost @@ engine/TickService.cpp @@ if (work.callGlobal) Call
 tick.serial-stuck @@ engine/TickService.cpp @@ sTickSerial.fetch_add(1, kRelaxed); @@ (void)0;
 tick.argument-ignored @@ engine/TickService.cpp @@ fn(arg != nullptr ? arg : const_cast<ClockTime*>(now)); @@ fn(const_cast<ClockTime*>(now));
 # --- wait list (engine/WaitList.cpp) ---
-list.head-due-strict @@ engine/WaitList.cpp @@ if (!Due(EffectiveDeadline(node, offset), now)) { @@ if (!Earlier(EffectiveDeadline(node, offset), now)) {
+list.head-due-strict @@ engine/WaitList.cpp @@ if (!Due(effective, now)) {<NL>            if (!whole) break; @@ if (!Earlier(effective, now)) {<NL>            if (!whole) break;
 list.equal-before @@ engine/WaitList.cpp @@ if (Earlier(own, EffectiveDeadline(following, offset))) { @@ if (!Earlier(EffectiveDeadline(following, offset), own)) {
 list.equal-head-before @@ engine/WaitList.cpp @@ } else if (Earlier(own, EffectiveDeadline(head, offset))) { @@ } else if (!Earlier(EffectiveDeadline(head, offset), own)) {
 list.new-head-not-armed @@ engine/WaitList.cpp @@ if (NeedsTimer(node, effective) && Earlier(effective, gNextDeadline.Load())) { @@ if (false) {
 list.queued-without-timer @@ engine/WaitList.cpp @@         if (TimerServing()) {<NL>            LinkSorted(node, offset); @@         if (true) {<NL>            LinkSorted(node, offset);
 list.self-waking-posted @@ engine/WaitList.cpp @@ if (self != 0 && Due(self, now)) node->postOnFire.store(0, kRelaxed); @@ (void)self;
 list.self-waking-armed @@ engine/WaitList.cpp @@ return self == 0 || Earlier(effective + kSelfWakeSlackNs, self); @@ return true;
-list.rest-not-folded @@ engine/WaitList.cpp @@ if (EarliestNeedingTimer(offset, earliest) && Earlier(earliest, gNextDeadline.Load())) { @@ if (false) {
+list.rest-not-folded @@ engine/WaitList.cpp @@ if (seen && Earlier(earliest, gNextDeadline.Load())) gNextDeadline.Store(earliest); @@ (void)seen;
+list.walk-earliest-first @@ engine/WaitList.cpp @@ if (NeedsTimer(node, effective) && (!seen || Earlier(effective, earliest))) { @@ if (NeedsTimer(node, effective) && !seen) {
 list.stale-order-ignored @@ engine/WaitList.cpp @@ bool OrderMayBeStale() { return gQueuedGlobalNodes.load(kRelaxed) != 0; } @@ bool OrderMayBeStale() { return false; }
 list.earliest-first-only @@ engine/WaitList.cpp @@ if (!found || Earlier(effective, out)) out = effective; @@ if (!found) out = effective;
 list.armed-only-as-head @@ engine/WaitList.cpp @@ if (NeedsTimer(node, effective) && Earlier(effective, gNextDeadline.Load())) { @@ if (gWaitList.load(kRelaxed) == node && NeedsTimer(node, effective) && Earlier(effective, gNextDeadline.Load())) {
