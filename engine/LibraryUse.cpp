@@ -18,7 +18,7 @@ namespace {
 // before it returns, so the stop (which broadcasts under the same lock) never
 // touches a semaphore that its owner may already have destroyed. Room for
 // every node-using wait plus as many waits without a node; a waiter that
-// finds no room still waits, and the stop's grace period is then its bound.
+// finds no room waits in short slices and looks for the stop between them.
 constexpr uint32_t kMaxBlocked = 2 * kWaitNodeCount;
 PalSemaphore* gBlocked[kMaxBlocked];
 
@@ -41,6 +41,27 @@ void Unlist(int32_t slot) {
 
 bool Stopping() { return gStopping.load(std::memory_order_seq_cst); }
 
+// A waiter the stop cannot wake (no room in the list): it waits at most
+// kUnlistedSliceNs at a time, so that it finds the stop well inside the
+// stop's grace period and leaves before the library is gone.
+constexpr int64_t kUnlistedSliceNs = 5 * 1000 * 1000;
+
+uint32_t WaitInSlices(PalSemaphore* semaphore, const timespec* deadline) {
+    for (;;) {
+        timespec slice{};
+        clock_gettime(CLOCK_MONOTONIC, &slice);
+        slice.tv_nsec += kUnlistedSliceNs;
+        if (slice.tv_nsec >= 1000000000) {
+            slice.tv_nsec -= 1000000000;
+            ++slice.tv_sec;
+        }
+        const bool last = deadline != nullptr && (deadline->tv_sec < slice.tv_sec ||
+                                                  (deadline->tv_sec == slice.tv_sec && deadline->tv_nsec <= slice.tv_nsec));
+        const uint32_t r = PalSemaphoreWaitUntilUnless(semaphore, last ? deadline : &slice, &Stopping);
+        if (r != 1 || last) return r;  // taken, stopped, failed, or the caller's own deadline
+    }
+}
+
 }  // namespace
 
 CallerInside::CallerInside() : entered_(true) {
@@ -57,8 +78,13 @@ CallerInside::~CallerInside() {
 
 BlockResult BlockOn(PalSemaphore* semaphore, const timespec* deadline) {
     const int32_t slot = List(semaphore);
-    const uint32_t r = PalSemaphoreWaitUntilUnless(semaphore, deadline, &Stopping);
-    Unlist(slot);
+    uint32_t r;
+    if (slot >= 0) {
+        r = PalSemaphoreWaitUntilUnless(semaphore, deadline, &Stopping);
+        Unlist(slot);
+    } else {
+        r = WaitInSlices(semaphore, deadline);
+    }
     switch (r) {
         case 0: return BlockResult::kTaken;
         case 1: return BlockResult::kTimedOut;

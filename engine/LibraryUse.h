@@ -10,7 +10,9 @@
 // A caller that blocks on a semaphore inside the library blocks through
 // BlockOn, which lists the semaphore for the stop and gives up when the stop
 // has begun. The stop wakes every listed semaphore's waiters (a broadcast on
-// its condition, which posts nothing), and they find the stop and leave.
+// its condition, which posts nothing), and they find the stop and leave. The
+// list has room for two waiters per wait node; a waiter beyond that blocks in
+// 5 ms slices and looks for the stop between them.
 #ifndef QUELTA_ENGINE_LIBRARYUSE_H
 #define QUELTA_ENGINE_LIBRARYUSE_H
 

@@ -152,6 +152,8 @@ semaphore.trim-last-post @@ include/quelta/RuntimeSemaphore.h @@ if (s->count - 
 semaphore.never-trimmed @@ include/quelta/RuntimeSemaphore.h @@ if (s->count - s->waiters > 1) --s->count; @@ (void)0;
 semaphore.posts-unbounded @@ include/quelta/RuntimeSemaphore.h @@ if (s->count <= s->waiters) ++s->count; @@ ++s->count;
 semaphore.timed-out-takes @@ include/quelta/RuntimeSemaphore.h @@ result = abandoned ? 3 : rc == ETIMEDOUT ? 1 : 2; @@ result = abandoned ? 3 : rc == ETIMEDOUT ? 1 : 2;<NL>        if (s->count != 0 && !abandoned) { --s->count; result = 0; }
+# --- the stop (engine/LibraryUse.cpp) ---
+stop.unlisted-never-looks @@ engine/LibraryUse.cpp @@ r = WaitInSlices(semaphore, deadline); @@ r = PalSemaphoreWaitUntilUnless(semaphore, deadline, &Stopping);
 # --- log engine (log/tKPLogEngine.cpp) ---
 log.adjust-not-atomic @@ log/tKPLogEngine.cpp @@ static_cast<uint32_t>(enableCount.fetch_add(delta, kRelaxed)) @@ static_cast<uint32_t>(enableCount.exchange(enableCount.load(kRelaxed) + delta, kRelaxed))
 EOF

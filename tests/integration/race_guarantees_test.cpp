@@ -6,6 +6,7 @@
 #include <gtest/gtest.h>
 
 #include <fcntl.h>
+#include <pthread.h>
 #include <signal.h>
 #include <time.h>
 #include <unistd.h>
@@ -278,6 +279,59 @@ TEST(RaceGuaranteesUnload, UnloadEndsEveryWaitInsideTheLibrary) {
     for (PalSemaphore* s : runtimeSemaphores) {
         EXPECT_EQ(Drain(s), 0) << "unloading posted the runtime's semaphore";
         testsupport::DeleteRuntimeSemaphore(s);
+    }
+}
+
+// More threads blocked on runtime semaphores without a timeout than the
+// library keeps a list of (two per wait node): the unload still ends every
+// one of them, those it could not list included, before the library is gone.
+struct UnlistedWaiter {
+    testsupport::QueltaApi api;
+    PalSemaphore* semaphore;
+    std::atomic<int>* returned;
+    uint32_t result;
+};
+
+void* WaitWithoutTimeout(void* arg) {
+    auto* w = static_cast<UnlistedWaiter*>(arg);
+    w->result = w->api.EventWait(w->semaphore, 0xFFFFFFFFu);
+    w->returned->fetch_add(1);
+    return nullptr;
+}
+
+TEST(RaceGuaranteesUnload, UnloadEndsWaitsBeyondThoseItCanList) {
+    auto lib = std::make_unique<LoadedLibrary>();
+    ASSERT_TRUE(lib->ok()) << lib->error();
+    // Each on a semaphore of its own: a wake of one listed semaphore's
+    // waiters must not stand in for the others.
+    constexpr int kWaiters = 2 * 128 + 8;
+    std::atomic<int> returned{0};
+    std::vector<UnlistedWaiter> waiters;
+    for (int i = 0; i < kWaiters; ++i) {
+        waiters.push_back(UnlistedWaiter{lib->api(), testsupport::NewRuntimeSemaphore(), &returned, 99});
+    }
+    std::vector<pthread_t> threads;
+    pthread_attr_t small;
+    pthread_attr_init(&small);
+    pthread_attr_setstacksize(&small, 128 * 1024);  // 264 threads fit a 32-bit address space
+    for (UnlistedWaiter& w : waiters) {
+        pthread_t t;
+        ASSERT_EQ(pthread_create(&t, &small, WaitWithoutTimeout, &w), 0);
+        threads.push_back(t);
+    }
+    pthread_attr_destroy(&small);
+    usleep(300000);  // all of them blocked inside
+    ASSERT_EQ(returned.load(), 0);
+    lib.reset();  // the stop
+    for (const uint64_t end = MonoNowNs() + 2000 * kMs; returned.load() < kWaiters && MonoNowNs() < end;) {
+        usleep(1000);
+    }
+    ASSERT_EQ(returned.load(), kWaiters) << "waits not ended by the unload";
+    for (pthread_t t : threads) pthread_join(t, nullptr);
+    for (const UnlistedWaiter& w : waiters) {
+        EXPECT_EQ(w.result, 3u);
+        EXPECT_EQ(Drain(w.semaphore), 0) << "unloading posted the runtime's semaphore";
+        testsupport::DeleteRuntimeSemaphore(w.semaphore);
     }
 }
 
