@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <chrono>
 #include <thread>
 #include <vector>
 
@@ -34,26 +35,40 @@ bool Records(iKPLogEngine* log) {
 TEST(LogEnableNesting, AdjustmentsFromManyThreadsAreAllCounted) {
     iKPLogEngine* log = tKPLogEngine::Create();
     ASSERT_NE(log, nullptr);
-    constexpr int kThreads = 4, kEach = 50000;
+    // Each thread adjusts for 200 ms (not a fixed count, which a loaded
+    // machine could run one thread after another within single time slices,
+    // never at the same time), counting what it added.
+    constexpr int kThreads = 4;
     std::atomic<int> ready{0};
+    std::atomic<bool> stop{false};
+    std::atomic<int64_t> sum{0};
     std::vector<std::thread> threads;
     for (int t = 0; t < kThreads; ++t) {
-        threads.emplace_back([log, &ready] {
+        threads.emplace_back([log, &ready, &stop, &sum] {
             ready.fetch_add(1);
             while (ready.load() < kThreads) std::this_thread::yield();  // all start together
-            for (int i = 0; i < kEach; ++i) {
-                log->AdjustEnabled(+2);
-                log->AdjustEnabled(-1);
+            int64_t rounds = 0;
+            while (!stop.load(std::memory_order_relaxed)) {
+                for (int i = 0; i < 256; ++i) {
+                    log->AdjustEnabled(+2);
+                    log->AdjustEnabled(-1);
+                }
+                rounds += 256;
             }
+            sum.fetch_add(rounds);
         });
     }
+    while (ready.load() < kThreads) std::this_thread::yield();
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    stop.store(true);
     for (auto& t : threads) t.join();
-    // The sum is kThreads * kEach: one less than that keeps recording on,
-    // the last one switches it off.
-    log->AdjustEnabled(-(kThreads * kEach - 1));
+    // One less than the sum keeps recording on, the last one switches it off.
+    const int64_t total = sum.load();
+    ASSERT_LT(total, int64_t(1) << 30);
+    log->AdjustEnabled(-static_cast<int32_t>(total - 1));
     EXPECT_TRUE(Records(log)) << "adjustments made at the same time were lost";
     log->AdjustEnabled(-1);
-    EXPECT_FALSE(Records(log)) << "recording on after the last adjustment took the sum to 0";
+    EXPECT_FALSE(Records(log)) << "adjustments made at the same time were lost (or counted twice)";
     delete log;
 }
 
