@@ -109,20 +109,17 @@ bool NeedsTimer(const WaitNode* node, uint64_t effective) {
 bool OrderMayBeStale() { return gQueuedGlobalNodes.load(kRelaxed) != 0; }
 
 // The earliest deadline among the queued nodes that need the timer thread
-// (a holder that wakes by itself does not). With monotonic nodes only, the
-// first such node in list order; otherwise every node is looked at (at most
-// the pool's 128, a comparison each). Lock held.
-bool EarliestNeedingTimer(int64_t offset, uint64_t& out) {
-    const bool whole = OrderMayBeStale();
-    bool found = false;
+// (a holder that wakes by itself does not), when the list is in order: the
+// first such node. Lock held.
+bool FirstNeedingTimer(int64_t offset, uint64_t& out) {
     for (WaitNode* n = gWaitList.load(kRelaxed); n != nullptr; n = n->next.load(kRelaxed)) {
         const uint64_t effective = EffectiveDeadline(n, offset);
-        if (!NeedsTimer(n, effective)) continue;
-        if (!found || Earlier(effective, out)) out = effective;
-        found = true;
-        if (!whole) break;
+        if (NeedsTimer(n, effective)) {
+            out = effective;
+            return true;
+        }
     }
-    return found;
+    return false;
 }
 
 // On the timer thread, in a callback. Lock held (the timer cannot go away).
@@ -433,9 +430,14 @@ uint32_t DetachDueNodesLocked(uint64_t now, int64_t offset, WaitNode** batch, ui
         node = next;
     }
     // What stays queued: its earliest deadline that needs the timer thread
-    // goes into the next arming (if the batch was full, that is a past one,
-    // and the next pass comes at once).
-    if (!whole || node != nullptr) seen = EarliestNeedingTimer(offset, earliest);
+    // goes into the next arming. (A full batch leaves due nodes behind: the
+    // next pass comes at once.)
+    if (node != nullptr && n == room) {
+        seen = true;
+        earliest = now;
+    } else if (!whole) {
+        seen = FirstNeedingTimer(offset, earliest);
+    }
     if (seen && Earlier(earliest, gNextDeadline.Load())) gNextDeadline.Store(earliest);
     return n;
 }

@@ -77,7 +77,6 @@ list.self-waking-armed @@ engine/WaitList.cpp @@ return self == 0 || Earlier(eff
 list.rest-not-folded @@ engine/WaitList.cpp @@ if (seen && Earlier(earliest, gNextDeadline.Load())) gNextDeadline.Store(earliest); @@ (void)seen;
 list.walk-earliest-first @@ engine/WaitList.cpp @@ if (NeedsTimer(node, effective) && (!seen || Earlier(effective, earliest))) { @@ if (NeedsTimer(node, effective) && !seen) {
 list.stale-order-ignored @@ engine/WaitList.cpp @@ bool OrderMayBeStale() { return gQueuedGlobalNodes.load(kRelaxed) != 0; } @@ bool OrderMayBeStale() { return false; }
-list.earliest-first-only @@ engine/WaitList.cpp @@ if (!found || Earlier(effective, out)) out = effective; @@ if (!found) out = effective;
 list.armed-only-as-head @@ engine/WaitList.cpp @@ if (NeedsTimer(node, effective) && Earlier(effective, gNextDeadline.Load())) { @@ if (gWaitList.load(kRelaxed) == node && NeedsTimer(node, effective) && Earlier(effective, gNextDeadline.Load())) {
 list.abort-monotonic-too @@ engine/WaitList.cpp @@ if (node->isGlobal.load(kRelaxed) != 0 && node->abortable.load(kRelaxed) != 0) { @@ if (node->abortable.load(kRelaxed) != 0) {
 list.abort-unabortable-too @@ engine/WaitList.cpp @@ if (node->isGlobal.load(kRelaxed) != 0 && node->abortable.load(kRelaxed) != 0) { @@ if (node->isGlobal.load(kRelaxed) != 0) {

@@ -209,6 +209,34 @@ TEST_F(SchedulerGlobalNodes, AfterAWallClockStepEveryDueNodeFiresWhereverItStand
     h.Pass();
     EXPECT_NE(global->fireCount.load(), 0u);
 
+    // Stepped back, at a tick's pass (which makes the next deadline anew):
+    // the timer is armed for the earliest node that needs it, not for the
+    // first in the list's stale order.
+    h.SetNow(gNextTick.Load());
+    h.Pass();
+    const uint64_t tickAt = gNextTick.Load();
+    WaitNode* staleHead = h.Take();
+    staleHead->isGlobal.store(1);
+    staleHead->autoRelease.store(1);
+    staleHead->selfWakeAt.store(0);  // its holder needs the timer thread
+    const ClockTime staleHeadAt = FromU64(tickAt + 400 * 1000);
+    ASSERT_EQ(InsertWaitNode(staleHead, &staleHeadAt, nullptr, nullptr), 0u);
+    WaitNode* earliest = h.Take();
+    earliest->autoRelease.store(1);
+    const uint64_t earliestAt = tickAt + 500 * 1000;
+    const ClockTime earliestTime = FromU64(earliestAt);
+    ASSERT_EQ(InsertWaitNode(earliest, &earliestTime, nullptr, nullptr), 0u);
+    ASSERT_EQ(gWaitList.load(), staleHead);
+    gEngine.load()->SetEpochOffset(-1);
+    h.SetNow(tickAt);
+    h.Pass();
+    EXPECT_EQ(h.timer->LastArmed(), earliestAt) << "armed for the stale head, or the tick, not the earliest node";
+    gEngine.load()->SetEpochOffset(0);
+    h.SetNow(earliestAt);
+    h.Pass();
+    EXPECT_NE(staleHead->fireCount.load(), 0u);
+    EXPECT_NE(earliest->fireCount.load(), 0u);
+
     // Stepped forward: a global node behind a monotonic one is due first.
     WaitNode* first = h.Take();
     first->autoRelease.store(1);
