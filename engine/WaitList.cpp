@@ -28,10 +28,29 @@ constexpr std::memory_order kRelaxed = std::memory_order_relaxed;
 // checks again under the lock.
 std::atomic<uint32_t> gQueuedGlobalNodes{0};
 
+// The lowest and highest offset (global minus monotonic clock) that the
+// queued nodes were placed with, since global nodes have been queued. Read
+// and written only with the lock held (plain words: the lock orders them).
+// While they lie close together the list is in the order of its deadlines,
+// to within their spread; a step or a long slew of the wall clock since the
+// first of those inserts spreads them apart.
+bool gPlacedAny = false;
+int64_t gPlacedOffsetLow = 0;
+int64_t gPlacedOffsetHigh = 0;
+
 void CountQueued(const WaitNode* node, int32_t delta) {
     if (node->isGlobal.load(kRelaxed) != 0) {
-        gQueuedGlobalNodes.store(gQueuedGlobalNodes.load(kRelaxed) + static_cast<uint32_t>(delta), kRelaxed);
+        const uint32_t queued = gQueuedGlobalNodes.load(kRelaxed) + static_cast<uint32_t>(delta);
+        gQueuedGlobalNodes.store(queued, kRelaxed);
+        if (queued == 0) gPlacedAny = false;  // in order again, whatever came before
     }
+}
+
+// An insert placed its node with `offset` among global nodes. Lock held.
+void NotePlacementOffset(int64_t offset) {
+    if (!gPlacedAny || offset < gPlacedOffsetLow) gPlacedOffsetLow = offset;
+    if (!gPlacedAny || offset > gPlacedOffsetHigh) gPlacedOffsetHigh = offset;
+    gPlacedAny = true;
 }
 
 // Unlinks a queued node from the wait list. Lock held. The node's own links
@@ -101,12 +120,24 @@ bool NeedsTimer(const WaitNode* node, uint64_t effective) {
     return self == 0 || Earlier(effective + kSelfWakeSlackNs, self);
 }
 
-// Whether the list's order can differ from the deadlines' order. Each node
-// is placed by its deadline at its insert, a global-clock node at that
-// moment's offset; a step of the wall clock since then moves every global
-// deadline at once, so with global nodes queued the order may be stale and
-// no search can stop at the first node. Lock held.
-bool OrderMayBeStale() { return gQueuedGlobalNodes.load(kRelaxed) != 0; }
+// How far apart the offsets of the placements and of now may lie before the
+// list's order is taken as stale. Within it, a node behind one that is not
+// due can be due by at most this much, and fires when that one does: offsets
+// measured at different moments differ by well under a microsecond unless
+// the measuring thread was preempted.
+constexpr int64_t kOrderToleranceNs = 10 * 1000;
+
+// Whether the list's order can differ from the deadlines' order by more than
+// kOrderToleranceNs at `offset`. Each node is placed by its deadline at its
+// insert, among global-clock nodes with that moment's offset; a step of the
+// wall clock since moves every global deadline at once, and then no search
+// can stop at the first node. Lock held.
+bool OrderMayBeStale(int64_t offset) {
+    if (gQueuedGlobalNodes.load(kRelaxed) == 0 || !gPlacedAny) return false;
+    const int64_t low = offset < gPlacedOffsetLow ? offset : gPlacedOffsetLow;
+    const int64_t high = offset > gPlacedOffsetHigh ? offset : gPlacedOffsetHigh;
+    return high - low > kOrderToleranceNs;
+}
 
 // The earliest deadline among the queued nodes that need the timer thread
 // (a holder that wakes by itself does not), when the list is in order: the
@@ -235,6 +266,8 @@ void InitWaitNodePool(WaitNode* pool, uint32_t count) {
     gWaitNodePool.store(pool, kRelaxed);
     gWaitList.store(nullptr, kRelaxed);
     gFreeList.store(count ? pool : nullptr, kRelaxed);
+    gQueuedGlobalNodes.store(0, kRelaxed);
+    gPlacedAny = false;
 }
 
 bool IsPoolNode(const WaitNode* node) {
@@ -292,6 +325,7 @@ uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
         // Without a serving timer nothing would ever fire the node: refuse it
         // whatever its deadline instead of letting its waiter hang.
         if (TimerServing()) {
+            if (needOffset) NotePlacementOffset(offset);
             LinkSorted(node, offset);
             queued = true;
             // Armed for whenever it is earlier than the armed time, head or
@@ -403,7 +437,7 @@ void FireWaitNode(WaitNode* node) {
 }
 
 uint32_t DetachDueNodesLocked(uint64_t now, int64_t offset, WaitNode** batch, uint32_t room) {
-    const bool whole = OrderMayBeStale();
+    const bool whole = OrderMayBeStale(offset);
     uint32_t n = 0;
     // With the whole list walked, the earliest of what stays queued is
     // found on the way: one walk under the lock, not two.

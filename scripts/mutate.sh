@@ -71,12 +71,14 @@ list.head-due-strict @@ engine/WaitList.cpp @@ if (!Due(effective, now)) {<NL>  
 list.equal-before @@ engine/WaitList.cpp @@ if (Earlier(own, EffectiveDeadline(following, offset))) { @@ if (!Earlier(EffectiveDeadline(following, offset), own)) {
 list.equal-head-before @@ engine/WaitList.cpp @@ } else if (Earlier(own, EffectiveDeadline(head, offset))) { @@ } else if (!Earlier(EffectiveDeadline(head, offset), own)) {
 list.new-head-not-armed @@ engine/WaitList.cpp @@ if (NeedsTimer(node, effective) && Earlier(effective, gNextDeadline.Load())) { @@ if (false) {
-list.queued-without-timer @@ engine/WaitList.cpp @@         if (TimerServing()) {<NL>            LinkSorted(node, offset); @@         if (true) {<NL>            LinkSorted(node, offset);
+list.queued-without-timer @@ engine/WaitList.cpp @@         if (TimerServing()) {<NL>            if (needOffset) NotePlacementOffset(offset); @@         if (true) {<NL>            if (needOffset) NotePlacementOffset(offset);
 list.self-waking-posted @@ engine/WaitList.cpp @@ if (self != 0 && Due(self, now)) node->postOnFire.store(0, kRelaxed); @@ (void)self;
 list.self-waking-armed @@ engine/WaitList.cpp @@ return self == 0 || Earlier(effective + kSelfWakeSlackNs, self); @@ return true;
 list.rest-not-folded @@ engine/WaitList.cpp @@ if (seen && Earlier(earliest, gNextDeadline.Load())) gNextDeadline.Store(earliest); @@ (void)seen;
 list.walk-earliest-first @@ engine/WaitList.cpp @@ if (NeedsTimer(node, effective) && (!seen || Earlier(effective, earliest))) { @@ if (NeedsTimer(node, effective) && !seen) {
-list.stale-order-ignored @@ engine/WaitList.cpp @@ bool OrderMayBeStale() { return gQueuedGlobalNodes.load(kRelaxed) != 0; } @@ bool OrderMayBeStale() { return false; }
+list.stale-order-ignored @@ engine/WaitList.cpp @@ return high - low > kOrderToleranceNs; @@ return false;
+list.placement-not-noted @@ engine/WaitList.cpp @@ if (needOffset) NotePlacementOffset(offset); @@ (void)needOffset;
+list.pass-offset-ignored @@ engine/WaitList.cpp @@ const int64_t low = offset < gPlacedOffsetLow ? offset : gPlacedOffsetLow; @@ const int64_t low = gPlacedOffsetLow;
 list.armed-only-as-head @@ engine/WaitList.cpp @@ if (NeedsTimer(node, effective) && Earlier(effective, gNextDeadline.Load())) { @@ if (gWaitList.load(kRelaxed) == node && NeedsTimer(node, effective) && Earlier(effective, gNextDeadline.Load())) {
 list.abort-monotonic-too @@ engine/WaitList.cpp @@ if (node->isGlobal.load(kRelaxed) != 0 && node->abortable.load(kRelaxed) != 0) { @@ if (node->abortable.load(kRelaxed) != 0) {
 list.abort-unabortable-too @@ engine/WaitList.cpp @@ if (node->isGlobal.load(kRelaxed) != 0 && node->abortable.load(kRelaxed) != 0) { @@ if (node->isGlobal.load(kRelaxed) != 0) {
