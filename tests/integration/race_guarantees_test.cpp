@@ -288,12 +288,14 @@ TEST(RaceGuaranteesUnload, UnloadEndsEveryWaitInsideTheLibrary) {
 struct UnlistedWaiter {
     testsupport::QueltaApi api;
     PalSemaphore* semaphore;
+    std::atomic<int>* started;
     std::atomic<int>* returned;
     uint32_t result;
 };
 
 void* WaitWithoutTimeout(void* arg) {
     auto* w = static_cast<UnlistedWaiter*>(arg);
+    w->started->fetch_add(1);
     w->result = w->api.EventWait(w->semaphore, 0xFFFFFFFFu);
     w->returned->fetch_add(1);
     return nullptr;
@@ -305,10 +307,10 @@ TEST(RaceGuaranteesUnload, UnloadEndsWaitsBeyondThoseItCanList) {
     // Each on a semaphore of its own: a wake of one listed semaphore's
     // waiters must not stand in for the others.
     constexpr int kWaiters = 2 * 128 + 8;
-    std::atomic<int> returned{0};
+    std::atomic<int> started{0}, returned{0};
     std::vector<UnlistedWaiter> waiters;
     for (int i = 0; i < kWaiters; ++i) {
-        waiters.push_back(UnlistedWaiter{lib->api(), testsupport::NewRuntimeSemaphore(), &returned, 99});
+        waiters.push_back(UnlistedWaiter{lib->api(), testsupport::NewRuntimeSemaphore(), &started, &returned, 99});
     }
     std::vector<pthread_t> threads;
     pthread_attr_t small;
@@ -320,7 +322,13 @@ TEST(RaceGuaranteesUnload, UnloadEndsWaitsBeyondThoseItCanList) {
         threads.push_back(t);
     }
     pthread_attr_destroy(&small);
-    usleep(300000);  // all of them blocked inside
+    // Every thread on its way in (slow to start under an emulator), then a
+    // moment for the last of them to block inside.
+    for (const uint64_t end = MonoNowNs() + 10000 * kMs; started.load() < kWaiters && MonoNowNs() < end;) {
+        usleep(1000);
+    }
+    ASSERT_EQ(started.load(), kWaiters);
+    usleep(300000);
     ASSERT_EQ(returned.load(), 0);
     lib.reset();  // the stop
     for (const uint64_t end = MonoNowNs() + 2000 * kMs; returned.load() < kWaiters && MonoNowNs() < end;) {
