@@ -47,6 +47,18 @@ protected:
         const ClockTime d = FromU64(deadline);
         return InsertWaitNode(node, &d, nullptr, nullptr);
     }
+    // A node queued at `deadline` and released when it fires: global-clock or
+    // monotonic, its holder waking by itself at `selfWake` (0: it needs the
+    // timer thread).
+    WaitNode* QueueAt(uint64_t deadline, bool global, uint64_t selfWake = 0) {
+        WaitNode* node = h.Take();
+        node->isGlobal.store(global ? 1 : 0);
+        node->autoRelease.store(1);
+        node->selfWakeAt.store(selfWake);
+        const ClockTime d = FromU64(deadline);
+        EXPECT_EQ(InsertWaitNode(node, &d, nullptr, nullptr), 0u);
+        return node;
+    }
     uint32_t Queued() {
         uint32_t n = 0;
         for (WaitNode* w = gWaitList.load(); w != nullptr; w = w->next.load()) ++n;
@@ -165,19 +177,10 @@ TEST_F(SchedulerGlobalNodes, AWaiterThatWakesByItselfCostsTheTimerThreadNothing)
 // head whose waiter wakes by itself leaves the timer unarmed, so a callback
 // queued behind it would otherwise wait for the next tick.
 TEST_F(SchedulerGlobalNodes, ANodeBehindASelfWakingHeadIsArmedFor) {
-    WaitNode* head = h.Take();
-    head->isGlobal.store(1);
-    head->autoRelease.store(1);
-    head->selfWakeAt.store(h.Now() + 400 * 1000);
-    const ClockTime headAt = FromU64(h.Now() + 400 * 1000);
-    ASSERT_EQ(InsertWaitNode(head, &headAt, nullptr, nullptr), 0u);
+    WaitNode* head = QueueAt(h.Now() + 400 * 1000, true, h.Now() + 400 * 1000);
     ASSERT_EQ(h.timer->LastArmed(), kNeverTime64);
-
-    WaitNode* behind = h.Take();
-    behind->autoRelease.store(1);
     const uint64_t behindAt = h.Now() + 600 * 1000;
-    const ClockTime at = FromU64(behindAt);
-    ASSERT_EQ(InsertWaitNode(behind, &at, nullptr, nullptr), 0u);
+    QueueAt(behindAt, false);
     ASSERT_EQ(gWaitList.load(), head);
     EXPECT_EQ(h.timer->LastArmed(), behindAt) << "the callback behind the head waits for the next tick";
 }
@@ -188,16 +191,8 @@ TEST_F(SchedulerGlobalNodes, ANodeBehindASelfWakingHeadIsArmedFor) {
 // (which would make the timer thread spin until the stale head came due).
 TEST_F(SchedulerGlobalNodes, AfterAWallClockStepEveryDueNodeFiresWhereverItStands) {
     // Stepped back: a global head now 1 s later than the monotonic node behind it.
-    WaitNode* global = h.Take();
-    global->isGlobal.store(1);
-    global->autoRelease.store(1);
-    global->selfWakeAt.store(h.Now() + 400 * 1000);
-    const ClockTime globalAt = FromU64(h.Now() + 400 * 1000);
-    ASSERT_EQ(InsertWaitNode(global, &globalAt, nullptr, nullptr), 0u);
-    WaitNode* monotonic = h.Take();
-    monotonic->autoRelease.store(1);
-    const ClockTime monotonicAt = FromU64(h.Now() + 600 * 1000);
-    ASSERT_EQ(InsertWaitNode(monotonic, &monotonicAt, nullptr, nullptr), 0u);
+    WaitNode* global = QueueAt(h.Now() + 400 * 1000, true, h.Now() + 400 * 1000);
+    WaitNode* monotonic = QueueAt(h.Now() + 600 * 1000, false);
     gEngine.load()->SetEpochOffset(-1);
     h.SetNow(h.Now() + 700 * 1000);
     h.Pass();
@@ -215,17 +210,9 @@ TEST_F(SchedulerGlobalNodes, AfterAWallClockStepEveryDueNodeFiresWhereverItStand
     h.SetNow(gNextTick.Load());
     h.Pass();
     const uint64_t tickAt = gNextTick.Load();
-    WaitNode* staleHead = h.Take();
-    staleHead->isGlobal.store(1);
-    staleHead->autoRelease.store(1);
-    staleHead->selfWakeAt.store(0);  // its holder needs the timer thread
-    const ClockTime staleHeadAt = FromU64(tickAt + 400 * 1000);
-    ASSERT_EQ(InsertWaitNode(staleHead, &staleHeadAt, nullptr, nullptr), 0u);
-    WaitNode* earliest = h.Take();
-    earliest->autoRelease.store(1);
+    WaitNode* staleHead = QueueAt(tickAt + 400 * 1000, true);
     const uint64_t earliestAt = tickAt + 500 * 1000;
-    const ClockTime earliestTime = FromU64(earliestAt);
-    ASSERT_EQ(InsertWaitNode(earliest, &earliestTime, nullptr, nullptr), 0u);
+    WaitNode* earliest = QueueAt(earliestAt, false);
     ASSERT_EQ(gWaitList.load(), staleHead);
     gEngine.load()->SetEpochOffset(-1);
     h.SetNow(tickAt);
@@ -238,15 +225,8 @@ TEST_F(SchedulerGlobalNodes, AfterAWallClockStepEveryDueNodeFiresWhereverItStand
     EXPECT_NE(earliest->fireCount.load(), 0u);
 
     // Stepped forward: a global node behind a monotonic one is due first.
-    WaitNode* first = h.Take();
-    first->autoRelease.store(1);
-    const ClockTime firstAt = FromU64(h.Now() + 2 * kSecond);
-    ASSERT_EQ(InsertWaitNode(first, &firstAt, nullptr, nullptr), 0u);
-    WaitNode* stepped = h.Take();
-    stepped->isGlobal.store(1);
-    stepped->autoRelease.store(1);
-    const ClockTime steppedAt = FromU64(h.Now() + 3 * kSecond);
-    ASSERT_EQ(InsertWaitNode(stepped, &steppedAt, nullptr, nullptr), 0u);
+    WaitNode* first = QueueAt(h.Now() + 2 * kSecond, false);
+    WaitNode* stepped = QueueAt(h.Now() + 3 * kSecond, true);
     ASSERT_EQ(gWaitList.load(), first);
     gEngine.load()->SetEpochOffset(2);  // its deadline is now 1 s ahead
     h.SetNow(h.Now() + 1500 * kMs);
