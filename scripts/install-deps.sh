@@ -8,7 +8,9 @@ want=(cmake g++ make ninja-build pkg-config googletest libgtest-dev libbenchmark
 # (nlohmann-json and CLI11 are the tools' JSON and command-line libraries,
 # dpkg-dev, file and lintian check the packages, doxygen builds the API
 # reference; the library itself needs nothing but the C++ standard library.)
-# Never g++-multilib: on Debian 12 installing it removes the ARM cross compiler.
+# The 32-bit x86 stage uses its own cross compiler and libc6-i386, never the
+# host compiler's 32-bit add-on packages: on Debian 12 those remove the ARM
+# cross compiler.
 missing=()
 for p in "${want[@]}"; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")
