@@ -12,6 +12,7 @@
 #include <string>
 #include <thread>
 
+#include "GlobalCallbackRecord.h"
 #include "TestSupport.h"
 #include "engine/ClockTimeOps.h"
 #include "engine/EpochOffset.h"
@@ -146,15 +147,10 @@ TEST_P(WallClockFutureLive, GlobalDeadlineEventWaitEndsAtItsDeadline) {
 }
 
 std::atomic<uint64_t> gFiredAt{0};
-void RecordGlobal(void*) {
-    ClockTime g;
-    GetEngine__MERIDOX()->ReadGlobal2(g);
-    gFiredAt = ToU64(g);
-}
 
 TEST_P(WallClockFutureLive, GlobalCallbackTimeFiresAtItsTime) {
     gFiredAt = 0;
-    quelta_iTSC_SetCallback(RecordGlobal, nullptr);
+    quelta_iTSC_SetCallback(testsupport::StoreGlobalNow, &gFiredAt);
     const ClockTime when = FromU64(GlobalNow() + 20 * kMs);
     ASSERT_EQ(quelta_iTSC_SetCallbackTime(&when, -1), 1u);
     testsupport::AwaitNonZero(gFiredAt, kLostAfterNs);

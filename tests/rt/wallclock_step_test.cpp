@@ -6,6 +6,7 @@
 #include <atomic>
 #include <thread>
 
+#include "GlobalCallbackRecord.h"
 #include "TestSupport.h"
 #include "engine/LibraryFrame.h"
 #include "engine/SystemClock.h"
@@ -85,15 +86,10 @@ TEST_F(WallClockStep, GlobalWaitEndsLaterWhenTheClockStepsBack) {
 }
 
 std::atomic<uint64_t> gFiredGlobal{0};
-void MarkGlobal(void*) {
-    ClockTime g;
-    GetEngine__MERIDOX()->ReadGlobal2(g);
-    gFiredGlobal = ToU64(g);
-}
 
 TEST_F(WallClockStep, GlobalCallbackTimeMovesWithTheStep) {
     gFiredGlobal = 0;
-    quelta_iTSC_SetCallback(MarkGlobal, nullptr);
+    quelta_iTSC_SetCallback(testsupport::StoreGlobalNow, &gFiredGlobal);
     const ClockTime when = FromU64(GlobalNow() + 80 * kMs);
     ASSERT_EQ(quelta_iTSC_SetCallbackTime(&when, -1), 1u);
     const uint64_t start = testsupport::MonoNowNs();
