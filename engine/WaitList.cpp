@@ -29,28 +29,28 @@ constexpr std::memory_order kRelaxed = std::memory_order_relaxed;
 std::atomic<uint32_t> gQueuedGlobalNodes{0};
 
 // The lowest and highest offset (global minus monotonic clock) that the
-// queued nodes were placed with, since global nodes have been queued. Read
-// and written only with the lock held (plain words: the lock orders them).
-// While they lie close together the list is in the order of its deadlines,
-// to within their spread; a step or a long slew of the wall clock since the
-// first of those inserts spreads them apart.
-bool gPlacedAny = false;
+// queued nodes were placed with, since global nodes have been queued (they
+// mean nothing while gQueuedGlobalNodes is 0). Read and written only with the
+// lock held (plain words: the lock orders them). While they lie close
+// together the list is in the order of its deadlines, to within their spread;
+// a step or a long slew of the wall clock since the first of those inserts
+// spreads them apart.
 int64_t gPlacedOffsetLow = 0;
 int64_t gPlacedOffsetHigh = 0;
 
 void CountQueued(const WaitNode* node, int32_t delta) {
     if (node->isGlobal.load(kRelaxed) != 0) {
-        const uint32_t queued = gQueuedGlobalNodes.load(kRelaxed) + static_cast<uint32_t>(delta);
-        gQueuedGlobalNodes.store(queued, kRelaxed);
-        if (queued == 0) gPlacedAny = false;  // in order again, whatever came before
+        gQueuedGlobalNodes.store(gQueuedGlobalNodes.load(kRelaxed) + static_cast<uint32_t>(delta), kRelaxed);
     }
 }
 
-// An insert placed its node with `offset` among global nodes. Lock held.
+// An insert places its node with `offset` (called before it is linked). The
+// first global node of an otherwise monotonic list starts a fresh span: the
+// list is in order again, whatever came before. Lock held.
 void NotePlacementOffset(int64_t offset) {
-    if (!gPlacedAny || offset < gPlacedOffsetLow) gPlacedOffsetLow = offset;
-    if (!gPlacedAny || offset > gPlacedOffsetHigh) gPlacedOffsetHigh = offset;
-    gPlacedAny = true;
+    const bool fresh = gQueuedGlobalNodes.load(kRelaxed) == 0;
+    if (fresh || offset < gPlacedOffsetLow) gPlacedOffsetLow = offset;
+    if (fresh || offset > gPlacedOffsetHigh) gPlacedOffsetHigh = offset;
 }
 
 // Unlinks a queued node from the wait list. Lock held. The node's own links
@@ -133,7 +133,7 @@ constexpr int64_t kOrderToleranceNs = 10 * 1000;
 // wall clock since moves every global deadline at once, and then no search
 // can stop at the first node. Lock held.
 bool OrderMayBeStale(int64_t offset) {
-    if (gQueuedGlobalNodes.load(kRelaxed) == 0 || !gPlacedAny) return false;
+    if (gQueuedGlobalNodes.load(kRelaxed) == 0) return false;
     const int64_t low = offset < gPlacedOffsetLow ? offset : gPlacedOffsetLow;
     const int64_t high = offset > gPlacedOffsetHigh ? offset : gPlacedOffsetHigh;
     return high - low > kOrderToleranceNs;
@@ -267,7 +267,6 @@ void InitWaitNodePool(WaitNode* pool, uint32_t count) {
     gWaitList.store(nullptr, kRelaxed);
     gFreeList.store(count ? pool : nullptr, kRelaxed);
     gQueuedGlobalNodes.store(0, kRelaxed);
-    gPlacedAny = false;
 }
 
 bool IsPoolNode(const WaitNode* node) {

@@ -190,19 +190,24 @@ TEST_F(SchedulerGlobalNodes, ANodeBehindASelfWakingHeadIsArmedFor) {
 // is due wherever it stands, and never arms the timer for a time already past
 // (which would make the timer thread spin until the stale head came due).
 TEST_F(SchedulerGlobalNodes, AfterAWallClockStepEveryDueNodeFiresWhereverItStands) {
-    // Stepped back: a global head now 1 s later than the monotonic node behind it.
-    WaitNode* global = QueueAt(h.Now() + 400 * 1000, true, h.Now() + 400 * 1000);
+    // Placed while the wall clock read 1 s ahead (global = monotonic + 1 s),
+    // then stepped back to the monotonic clock: a global head now 1 s later
+    // than the monotonic node behind it.
+    gEngine.load()->SetEpochOffset(1);
+    WaitNode* global = QueueAt(h.Now() + kSecond + 400 * 1000, true, h.Now() + 400 * 1000);
     WaitNode* monotonic = QueueAt(h.Now() + 600 * 1000, false);
-    gEngine.load()->SetEpochOffset(-1);
+    ASSERT_EQ(gWaitList.load(), global);
+    gEngine.load()->SetEpochOffset(0);
     h.SetNow(h.Now() + 700 * 1000);
     h.Pass();
     EXPECT_NE(monotonic->fireCount.load(), 0u) << "a due node behind a stepped head did not fire";
     EXPECT_EQ(global->fireCount.load(), 0u) << "fired 1 s early";
     EXPECT_FALSE(Earlier(h.timer->LastArmed(), h.Now())) << "armed for a time already past";
-    gEngine.load()->SetEpochOffset(0);
+    gEngine.load()->SetEpochOffset(1);
     h.SetNow(h.Now() + 1000);
     h.Pass();
     EXPECT_NE(global->fireCount.load(), 0u);
+    gEngine.load()->SetEpochOffset(0);
 
     // Stepped back, at a tick's pass (which makes the next deadline anew):
     // the timer is armed for the earliest node that needs it, not for the
