@@ -3,6 +3,7 @@
 #include "engine/LibraryUse.h"
 
 #include "engine/WaitList.h"
+#include "quelta/RuntimeSemaphore.h"
 #include "tLinux/PalSemaphoreOps.h"
 #include "tLinux/PalThreads.h"
 
@@ -41,20 +42,14 @@ void Unlist(int32_t slot) {
 
 bool Stopping() { return gStopping.load(std::memory_order_seq_cst); }
 
-// A waiter the stop cannot wake (no room in the list): it waits at most
-// kUnlistedSliceNs at a time, so that it finds the stop well inside the
+// A waiter the stop cannot wake (no room in the list) waits at most
+// kUnlistedSliceMs at a time, so that it finds the stop well inside the
 // stop's grace period and leaves before the library is gone.
-constexpr int64_t kUnlistedSliceNs = 5 * 1000 * 1000;
+constexpr int32_t kUnlistedSliceMs = 5;
 
 uint32_t WaitInSlices(PalSemaphore* semaphore, const timespec* deadline) {
     for (;;) {
-        timespec slice{};
-        clock_gettime(CLOCK_MONOTONIC, &slice);
-        slice.tv_nsec += kUnlistedSliceNs;
-        if (slice.tv_nsec >= 1000000000) {
-            slice.tv_nsec -= 1000000000;
-            ++slice.tv_sec;
-        }
+        const timespec slice = quelta_runtime::DeadlineAfterMs(CLOCK_MONOTONIC, kUnlistedSliceMs);
         const bool last = deadline != nullptr && (deadline->tv_sec < slice.tv_sec ||
                                                   (deadline->tv_sec == slice.tv_sec && deadline->tv_nsec <= slice.tv_nsec));
         const uint32_t r = PalSemaphoreWaitUntilUnless(semaphore, last ? deadline : &slice, &Stopping);
