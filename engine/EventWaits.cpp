@@ -88,24 +88,27 @@ WaitEnd WaitUntilMonotonic(WaitNode* node, uint64_t deadline) {
 }
 
 // Blocks on the queued node's own semaphore until the global clock reaches
-// `deadline`. The bound is the deadline's monotonic equivalent, taken afresh
-// on every round, and the end is checked on the global clock itself, so a
-// step of the wall clock in either direction moves it; the tick service's
-// firing (a step forward between rounds, a new generation) ends a round
-// early. An abortable node fired while the generation differs from the
+// `deadline`. The global clock is the one the conversion defines (the
+// kernel's call where it exists): each round measures the offset between it
+// and the monotonic clock once, and the wait is over when the monotonic clock
+// has passed the deadline's equivalent at that offset, the rule the tick
+// service fires nodes by. The end is never judged from a wall-clock reading
+// of its own, which could disagree with the conversion and then end the wait
+// early or keep it spinning on a bound already past. A step of the wall clock
+// moves the equivalent: the tick service's firing (a step forward), or the
+// timed wake finding the equivalent later than it was (a step back), starts
+// a new round. An abortable node fired while the generation differs from the
 // caller's ends the wait as aborted.
-WaitEnd WaitUntilGlobal(iKPusTimingEngine* engine, WaitNode* node, const ClockTime& deadline,
-                        uint32_t generation) {
+WaitEnd WaitUntilGlobal(WaitNode* node, const ClockTime& deadline, uint32_t generation) {
     PalSemaphore* own = node->ownSemaphore.load(kRelaxed);
     for (;;) {
-        ClockTime now;
-        engine->ReadGlobal6(now);
-        if (!Earlier(now, deadline)) return WaitEnd::kDue;
         if (node->abortable.load(kRelaxed) != 0 && node->fireCount.load(std::memory_order_acquire) != 0 &&
             gGeneration.load(kRelaxed) != generation) {
             return WaitEnd::kAborted;
         }
-        const uint64_t bound = GlobalToMonotonicAt(ToU64(deadline), GlobalOffset());
+        uint64_t now = 0;
+        const uint64_t bound = GlobalToMonotonicAt(ToU64(deadline), GlobalOffset(&now));
+        if (Due(bound, now)) return WaitEnd::kDue;
         node->selfWakeAt.store(bound == 0 ? 1 : bound, kRelaxed);
         switch (BlockUntil(own, bound)) {
             case BlockResult::kStopped: return WaitEnd::kStopped;
@@ -208,7 +211,7 @@ extern "C" QUELTA_EXPORT void quelta_iTSC_WaitUntilGlobalClocks64_C(const ClockT
         const ClockTime copy = *target;
         WaitEnd end = WaitEnd::kDue;
         ExpectSelfWake(node, copy);
-        if (InsertWaitNode(node, &copy, nullptr, nullptr) == 0) end = WaitUntilGlobal(engine, node, copy, generation);
+        if (InsertWaitNode(node, &copy, nullptr, nullptr) == 0) end = WaitUntilGlobal(node, copy, generation);
         if (abortFlag != nullptr && (end == WaitEnd::kStopped || generation != gGeneration.load(kRelaxed))) {
             *abortFlag = 1;
         }
@@ -251,7 +254,7 @@ extern "C" QUELTA_EXPORT uint32_t quelta_iTSCEvent_Wait_Callback_C(PalSemaphore*
     if (isGlobal != 0) {
         ExpectSelfWake(node, copy);
         r = InsertWaitNode(node, &copy, callback, callbackArg);
-        if (r == 0) end = WaitUntilGlobal(engine, node, copy, 0);
+        if (r == 0) end = WaitUntilGlobal(node, copy, 0);
     } else {
         node->deadline.store(ToU64(copy), kRelaxed);
         r = TimerServesNow() ? 0 : 1;  // without a timer the call is refused at once, as ever

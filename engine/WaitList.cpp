@@ -214,12 +214,13 @@ SchedLockGuard::SchedLockGuard() {
 }
 SchedLockGuard::~SchedLockGuard() { pthread_mutex_unlock(&gSchedLock); }
 
-int64_t GlobalOffset() {
-    tKPusTimingEngine* engine = gEngine.load(std::memory_order_acquire);
-    if (engine == nullptr) return 0;
+int64_t GlobalOffset(uint64_t* monotonicOut) {
     timespec ts{};
     gSystemClock.getTime(CLOCK_MONOTONIC, &ts);  // not recorded: this is no reading of the caller's
     const uint64_t monotonic = static_cast<uint64_t>(ts.tv_sec) * 1000000000u + static_cast<uint64_t>(ts.tv_nsec);
+    if (monotonicOut != nullptr) *monotonicOut = monotonic;
+    tKPusTimingEngine* engine = gEngine.load(std::memory_order_acquire);
+    if (engine == nullptr) return 0;
     iKPusTimingEngine* e = engine;
     return GlobalOffsetOf(monotonic, ToU64(e->MonotonicToGlobal(FromU64(monotonic))));
 }

@@ -104,8 +104,9 @@ public:
 // The offset between the global and the monotonic clock at one moment:
 // global time minus monotonic time (wrapping). Every step and slew of the
 // wall clock up to that moment is in it. Measured with one conversion
-// (engine slot 15) outside any lock; 0 without an engine.
-int64_t GlobalOffset();
+// (engine slot 15) outside any lock; 0 without an engine. The monotonic
+// reading it converted is stored in `monotonic` when given.
+int64_t GlobalOffset(uint64_t* monotonic = nullptr);
 // The same from a pass's own reading pair (now and its global equivalent).
 inline int64_t GlobalOffsetOf(uint64_t monotonic, uint64_t global) {
     return static_cast<int64_t>(global - monotonic);

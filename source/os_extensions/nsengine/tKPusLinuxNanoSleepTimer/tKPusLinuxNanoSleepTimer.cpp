@@ -72,19 +72,55 @@ PalSleepResult NanosleepUntil(TimerThreadState& state, const timespec& deadline,
     }
 }
 
+// True when an expiry was set after the take that `takenCount` belongs to,
+// or the thread is to stop.
+bool ExpirySetSince(TimerThreadState& state, uint32_t takenCount) {
+    pthread_mutex_lock(&state.expiryLock);
+    const bool set = state.setCount != takenCount;
+    pthread_mutex_unlock(&state.expiryLock);
+    return set || StopRequested(&state);
+}
+
+timespec Earliest(const timespec& a, const timespec& b) {
+    if (a.tv_sec != b.tv_sec) return a.tv_sec < b.tv_sec ? a : b;
+    return a.tv_nsec <= b.tv_nsec ? a : b;
+}
+
+// A clock_nanosleep until `deadline`, blind for one tick at most (see
+// kBlindSleepNs): at each bound short of the deadline, an expiry set since
+// the take ends the sleep as a wake would have.
+PalSleepResult BoundedNanosleepUntil(TimerThreadState& state, uint32_t takenCount, const timespec& deadline,
+                                     bool kernelWake) {
+    for (;;) {
+        timespec bound{};
+        clock_gettime(CLOCK_MONOTONIC, &bound);
+        bound.tv_nsec += static_cast<long>(kBlindSleepNs);
+        if (bound.tv_nsec >= 1000000000L) {
+            bound.tv_nsec -= 1000000000L;
+            bound.tv_sec += 1;
+        }
+        const timespec until = Earliest(deadline, bound);
+        const PalSleepResult result = NanosleepUntil(state, until, kernelWake);
+        if (result != PalSleepResult::kDeadline) return result;
+        if (until.tv_sec == deadline.tv_sec && until.tv_nsec == deadline.tv_nsec) return result;
+        if (ExpirySetSince(state, takenCount)) return PalSleepResult::kWoken;
+    }
+}
+
 // One sleep of the timer thread until `deadline`, by the means that its
 // wakers use right now.
-PalSleepResult SleepUntil(TimerThreadState& state, uint32_t snapshot, const timespec& deadline) {
+PalSleepResult SleepUntil(TimerThreadState& state, uint32_t snapshot, uint32_t takenCount,
+                          const timespec& deadline) {
     PalSleepResult result;
     if (gWakeSyscallNr.load(std::memory_order_relaxed) >= 1) {
         SetSleepKind(state, TimerSleepKind::kNanosleep);
-        result = NanosleepUntil(state, deadline, true);
+        result = BoundedNanosleepUntil(state, takenCount, deadline, true);
     } else if (gPalWakeStandInEnabled.load(std::memory_order_relaxed)) {
         SetSleepKind(state, TimerSleepKind::kWakeWord);
         result = PalWakeableSleepUntil(state.wakeWord, snapshot, deadline, &StopRequested, &state);
     } else {
         SetSleepKind(state, TimerSleepKind::kNanosleep);
-        result = NanosleepUntil(state, deadline, false);
+        result = BoundedNanosleepUntil(state, takenCount, deadline, false);
     }
     SetSleepKind(state, TimerSleepKind::kAwake);
     return result;
@@ -178,6 +214,7 @@ void tKPusLinuxNanoSleepTimer::SetExpiry(ClockTime when) {
     const uint64_t seconds = ns / kNsPerSecond;
 
     pthread_mutex_lock(&state.expiryLock);
+    ++state.setCount;
     state.expiry.tv_sec = static_cast<int32_t>(static_cast<uint32_t>(seconds));
     state.expiry.tv_nsec = static_cast<int32_t>(ns - seconds * kNsPerSecond);
 
@@ -295,6 +332,7 @@ void* tKPusLinuxNanoSleepTimer::isrthread(TimerThreadState* state) {
         pthread_mutex_lock(&state->expiryLock);
         const uint32_t snapshot = PalWakeSnapshot(state->wakeWord);
         const TimerTimespec taken = state->expiry;
+        const uint32_t takenCount = state->setCount;
         state->expiry = TimerTimespec{kParkedSeconds, 0};
         pthread_mutex_unlock(&state->expiryLock);
         if (state->stopRequested.load() != 0) break;
@@ -302,7 +340,7 @@ void* tKPusLinuxNanoSleepTimer::isrthread(TimerThreadState* state) {
         timespec deadline{};
         deadline.tv_sec = taken.tv_sec;
         deadline.tv_nsec = taken.tv_nsec;
-        if (SleepUntil(*state, snapshot, deadline) == PalSleepResult::kDeadline) {
+        if (SleepUntil(*state, snapshot, takenCount, deadline) == PalSleepResult::kDeadline) {
             state->expiryCallback.load()();
         }
         // Woken or failed: go and take whatever expiry now holds (after the

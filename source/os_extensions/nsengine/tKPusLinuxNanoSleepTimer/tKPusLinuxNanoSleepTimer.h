@@ -34,6 +34,17 @@ namespace quelta {
 // monotonic clock's zero).
 constexpr int32_t kParkedSeconds = 0x7FFFFFFE;
 
+// A clock_nanosleep cannot be told "sleep unless the expiry moved since I
+// took it": a wake (the kernel's call, or SIGALRM) that lands between the
+// take and the kernel's sleep finds no sleep to end and is lost. Such a sleep
+// is therefore never blind for longer than one tick: this long after it
+// began, the thread looks whether a new expiry was set meanwhile and takes
+// it. The tick service arms at most one tick ahead, so while it runs the
+// bound never ends a sleep early; it counts when the thread is parked (the
+// first arming at start-up) or a wake was lost. The wake word's sleep closes
+// the window in the kernel and needs no bound.
+constexpr int32_t kBlindSleepNs = 1000000;  // 1 ms, one tick (under a second)
+
 // A 32-bit-seconds time point, as the timer keeps it on every target.
 struct TimerTimespec {
     int32_t tv_sec;
@@ -61,6 +72,11 @@ struct TimerThreadState {
     pthread_mutex_t expiryLock;              // priority-inheriting once Initialize ran
     std::atomic<uint8_t> stopRequested{0};  // written once, by the destructor
     std::atomic<QueltaExpiryCallbackFn> expiryCallback{nullptr};
+    // Beyond the record proper. Counts the expiries set (guarded by
+    // expiryLock): a clock_nanosleep that reaches its bound (see
+    // kBlindSleepNs) asks it whether a new expiry came since the take, whose
+    // wake may have been lost.
+    uint32_t setCount = 0;
     // Beyond the record proper. The wake word moves, under expiryLock,
     // whenever SetExpiry hands the thread a new expiry through the stand-in
     // (and once more on stop); the thread snapshots it under the lock with
