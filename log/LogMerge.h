@@ -23,7 +23,7 @@
 #include <cstdint>
 
 #include "engine/ClockTimeOps.h"
-#include "log/LogRecords.h"
+#include "log/LogHandOff.h"
 
 namespace quelta {
 
@@ -96,15 +96,12 @@ inline void LogMerge::LoadHead(uint32_t i) {
     LogMergeLeaf& leaf = leaves_[i];
     while (leaf.remaining != 0) {
         const LogEntry& entry = leaf.entries[leaf.pos];
-        const uint32_t low = entry.timeLow.load(std::memory_order_relaxed);
-        const uint32_t high = entry.timeHigh.load(std::memory_order_relaxed);
-        const uint32_t event = entry.event.load(std::memory_order_relaxed);
-        const uint32_t data = entry.data.load(std::memory_order_relaxed);
-        if (entry.check.load(std::memory_order_relaxed) == LogEntryCheck(low, high, event, data)) {
-            const uint64_t key = OrderKey((uint64_t(high) << 32) | low);
+        LogEntryWords words;
+        if (ReadEntry(entry, words)) {
+            const uint64_t key = OrderKey((uint64_t(words.high) << 32) | words.low);
             leaf.key = key > OrderKey(0) ? key : kLogNoHead;
-            leaf.event = event;
-            leaf.data = data;
+            leaf.event = words.event;
+            leaf.data = words.data;
             // The ring's next head, fetched while the other rings take
             // their turns: with many CPUs every head lies in another ring.
             // (Before slot 0 it is an address outside the ring, which a

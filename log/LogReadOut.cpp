@@ -13,6 +13,7 @@
 #include <cstring>
 
 #include "engine/ClockTimeOps.h"
+#include "log/LogHandOff.h"
 #include "log/tKPLogEngine.h"
 
 namespace quelta {
@@ -58,33 +59,30 @@ void tKPLogEngine::ReadOutMerged(uint32_t& count, uint32_t timeLow[], uint32_t t
     // that long. One barrier per read-out; recording stays free of them.
     activeBank.store(other, std::memory_order_seq_cst);
 
-    // The write indices first, then one acquire fence, then what they
-    // publish (wrap counts and entries): it pairs with each recorder's
-    // PublishFence, so every slot below an index seen here is whole. (Each
-    // index waits in its leaf's pos until the cursors are set.)
-    for (uint32_t i = 0; i < n; ++i) merge.Leaf(i).pos = records[frozen + i].writeIndex.load(kRelaxed);
-    std::atomic_thread_fence(std::memory_order_acquire);
+    // The write indices and wrap counts first, then one acquire fence, then
+    // the entries they publish (see LogHandOff.h). (Each pair waits in its
+    // leaf's pos and remaining until the cursors are set.)
+    for (uint32_t i = 0; i < n; ++i) {
+        const LogPublished published = LoadPublished(records[frozen + i]);
+        merge.Leaf(i).pos = published.writeIndex;
+        merge.Leaf(i).remaining = published.wrapCount;
+    }
+    AfterPublishedLoads<StdAtomics>();
 
-    // Cursors: each ring is read from its newest entry towards older ones. A
-    // write index beyond the ring (a recorder that still held a ring an
-    // earlier Configure replaced) is treated as a full ring.
+    // Cursors: each ring is read from its newest entry towards older ones.
     uint64_t total = 0;
     for (uint32_t i = 0; i < n; ++i) {
         LogCpuRecord& record = records[frozen + i];
         LogMergeLeaf& leaf = merge.Leaf(i);
         const LogRing ring = LockedRing(record);
-        const uint32_t written = leaf.pos;
-        uint32_t remaining = record.wrapCount.load(kRelaxed) != 0 ? ring.capacity : written;
-        if (remaining > ring.capacity) remaining = ring.capacity;
-        uint32_t pos = written - 1;
-        if (pos >= ring.capacity) pos = ring.capacity - 1;  // 0 on an empty ring
-        record.readPos.store(pos, kRelaxed);
-        record.readRemaining.store(remaining, kRelaxed);
+        const LogCursor cursor = StartCursor(LogPublished{leaf.pos, leaf.remaining}, ring.capacity);
+        record.readPos.store(cursor.pos, kRelaxed);
+        record.readRemaining.store(cursor.remaining, kRelaxed);
         leaf.entries = ring.entries;
         leaf.capacity = ring.capacity;
-        leaf.pos = pos;
-        leaf.remaining = remaining;
-        total += remaining;
+        leaf.pos = cursor.pos;
+        leaf.remaining = cursor.remaining;
+        total += cursor.remaining;
     }
 
     if (count > total) count = static_cast<uint32_t>(total);

@@ -7,15 +7,16 @@
 // undefined behaviour, and the read-out recognises a torn entry by its check
 // word (LogEntryCheck) and leaves it out.
 //
-// Publishing: a recorder writes the entry's words (and, on a wrap, the wrap
-// count), then PublishFence, then the write index. A read-out loads the write
-// indices, then an acquire fence, then everything else: every slot below an
-// index it saw holds a whole entry, never one claimed but not yet written.
+// The types are templates over the atomics policy (tLinux/PalAtomic.h) so
+// that the memory-model checks build the same records over their own
+// atomics; the library uses the StdAtomics instances named below. How
+// entries and rings are published lives in log/LogHandOff.h.
 #ifndef QUELTA_LOG_LOGRECORDS_H
 #define QUELTA_LOG_LOGRECORDS_H
 
-#include <atomic>
 #include <cstdint>
+
+#include "tLinux/PalAtomic.h"
 
 namespace quelta {
 
@@ -34,13 +35,15 @@ constexpr uint32_t kLogNoData = 0xFFFFFFFFu;
 
 // One recording: the ClockTime's two words (low first), the event and data
 // words, and a check word over the four.
-struct LogEntry {
-    std::atomic<uint32_t> timeLow;
-    std::atomic<uint32_t> timeHigh;
-    std::atomic<uint32_t> event;
-    std::atomic<uint32_t> data;
-    std::atomic<uint32_t> check;
+template <class A>
+struct BasicLogEntry {
+    typename A::template Atomic<uint32_t> timeLow;
+    typename A::template Atomic<uint32_t> timeHigh;
+    typename A::template Atomic<uint32_t> event;
+    typename A::template Atomic<uint32_t> data;
+    typename A::template Atomic<uint32_t> check;
 };
+using LogEntry = BasicLogEntry<StdAtomics>;
 static_assert(sizeof(LogEntry) == 20, "a log entry is five 32-bit words");
 
 // The check word: each of the four words passes through its own bijection
@@ -54,68 +57,48 @@ inline uint32_t LogEntryCheck(uint32_t low, uint32_t high, uint32_t event, uint3
     return low ^ (high * 0x9E3779B1u) ^ (event * 0x85EBCA77u) ^ (data * 0xC2B2AE3Du) ^ 0x27D4EB2Fu;
 }
 
-// Orders a recorder's entry stores (and its wrap-count store) before the
-// write-index store that publishes them. Only stores need ordering there
-// (the later store's address and value depend on the loads before it), so
-// on ARMv7 this is the store barrier `dmb ishst`, cheaper than the full
-// `dmb ish` a release fence becomes; on x86 a release fence emits nothing.
-inline void PublishFence() {
-#if defined(__arm__) && defined(__ARM_ARCH) && __ARM_ARCH >= 7 && !defined(__SANITIZE_THREAD__)
-    __asm__ __volatile__("dmb ishst" ::: "memory");
-#else
-    std::atomic_thread_fence(std::memory_order_release);
-#endif
-}
-
 // A heap ring is one allocation: this header, then `capacity` entries.
 // The capacity is written before the ring is published and never changes
 // while the ring lives, so a recorder that reaches the ring through its
 // pointer finds the matching bound through the same pointer.
-struct LogRingHeader {
-    std::atomic<uint32_t> capacity;
+template <class A>
+struct BasicLogRingHeader {
+    typename A::template Atomic<uint32_t> capacity;
 };
+using LogRingHeader = BasicLogRingHeader<StdAtomics>;
 static_assert(sizeof(LogRingHeader) % alignof(LogEntry) == 0, "entries follow the header");
 
-inline LogRingHeader* RingHeaderOf(LogEntry* entries) {
-    return reinterpret_cast<LogRingHeader*>(entries) - 1;
+template <class A>
+BasicLogRingHeader<A>* RingHeaderOf(BasicLogEntry<A>* entries) {
+    return reinterpret_cast<BasicLogRingHeader<A>*>(entries) - 1;
 }
 
-struct LogCpuRecord {
-    std::atomic<uint32_t> capacity;
-    std::atomic<LogEntry*> entries;
-    std::atomic<uint32_t> writeIndex;
-    std::atomic<uint32_t> wrapCount;
-    LogEntry inlineEntries[kLogInlineSlots];
-    std::atomic<uint32_t> readPos;
-    std::atomic<uint32_t> readRemaining;
+template <class A>
+struct BasicLogCpuRecord {
+    typename A::template Atomic<uint32_t> capacity;
+    typename A::template Atomic<BasicLogEntry<A>*> entries;
+    typename A::template Atomic<uint32_t> writeIndex;
+    typename A::template Atomic<uint32_t> wrapCount;
+    BasicLogEntry<A> inlineEntries[kLogInlineSlots];
+    typename A::template Atomic<uint32_t> readPos;
+    typename A::template Atomic<uint32_t> readRemaining;
 };
+using LogCpuRecord = BasicLogCpuRecord<StdAtomics>;
 
 // A ring as one thread sees it: the array and a bound never larger than it.
-struct LogRing {
-    LogEntry* entries;
+template <class A>
+struct BasicLogRing {
+    BasicLogEntry<A>* entries;
     uint32_t capacity;  // 0: no usable ring
 };
-
-// The ring a recorder writes into. Configure may swap rings at any moment
-// (recorders take no lock), so the bound must belong to the array it is used
-// on: the inline ring's size is known from its address, a heap ring's is
-// read from its own header through the pointer just loaded. That load
-// depends on the pointer's value, which orders it after the pointer load on
-// every processor this library targets (ARM and x86 keep address
-// dependencies), so no barrier is needed where an acquire load would put one.
-inline LogRing RecorderRing(const LogCpuRecord& record) {
-    LogEntry* entries = record.entries.load(std::memory_order_relaxed);
-    if (entries == record.inlineEntries) return LogRing{entries, kLogInlineCapacity};
-    if (entries == nullptr) return LogRing{nullptr, 0};
-    return LogRing{entries, RingHeaderOf(entries)->capacity.load(std::memory_order_relaxed)};
-}
+using LogRing = BasicLogRing<StdAtomics>;
 
 // The ring as the read-out and Configure see it. Both hold the engine's
 // maintenance lock, under which rings are only swapped by Configure itself,
 // so the record's own pair is consistent.
-inline LogRing LockedRing(const LogCpuRecord& record) {
-    return LogRing{record.entries.load(std::memory_order_relaxed),
-                   record.capacity.load(std::memory_order_relaxed)};
+template <class A>
+BasicLogRing<A> LockedRing(const BasicLogCpuRecord<A>& record) {
+    return BasicLogRing<A>{A::Load(record.entries, A::kRelaxed), A::Load(record.capacity, A::kRelaxed)};
 }
 
 }  // namespace quelta

@@ -10,6 +10,7 @@
 
 #include "engine/LibraryFrame.h"
 #include "engine/tKPusTimingEngine.h"
+#include "log/LogHandOff.h"
 #include "tLinux/PalMemory.h"
 #include "tLinux/PalThreads.h"
 
@@ -31,22 +32,6 @@ void ClearRecord(LogCpuRecord& record) {
     record.wrapCount.store(0, kRelaxed);
 }
 
-// Writes every word of `count` entries. This is also what puts the ring's
-// pages in place: a new heap block is only address space until first
-// written, and the first write to each page would otherwise fault on a
-// recorder's path (one fault per page, each costing that recorder
-// microseconds).
-void ClearEntries(LogEntry* entries, uint32_t count) {
-    for (uint32_t i = 0; i < count; ++i) {
-        LogEntry& entry = entries[i];
-        entry.timeLow.store(0, kRelaxed);
-        entry.timeHigh.store(0, kRelaxed);
-        entry.event.store(0, kRelaxed);
-        entry.data.store(0, kRelaxed);
-        entry.check.store(0, kRelaxed);
-    }
-}
-
 // A heap ring of `capacity` entries behind its header, every page written;
 // null when the allocator refuses it or when it is too large to ask for.
 LogEntry* AllocateRing(uint32_t capacity) {
@@ -54,12 +39,7 @@ LogEntry* AllocateRing(uint32_t capacity) {
     if (capacity > (SIZE_MAX - sizeof(LogRingHeader)) / sizeof(LogEntry)) return nullptr;  // 32-bit
     void* block = PalMemAlloc(sizeof(LogRingHeader) + size_t(capacity) * sizeof(LogEntry));
     if (block == nullptr) return nullptr;
-    LogRingHeader* header = new (block) LogRingHeader;
-    header->capacity.store(capacity, kRelaxed);
-    LogEntry* entries = reinterpret_cast<LogEntry*>(header + 1);
-    for (uint32_t i = 0; i < capacity; ++i) new (&entries[i]) LogEntry;
-    ClearEntries(entries, capacity);
-    return entries;
+    return BuildRing<StdAtomics>(block, capacity);
 }
 
 void FreeRing(LogEntry* entries) { PalMemFree(RingHeaderOf(entries)); }
@@ -179,10 +159,7 @@ uint32_t tKPLogEngine::Configure(int32_t capacity) {
             failed = true;
             continue;
         }
-        record.capacity.store(cap, kRelaxed);
-        // Release: the header and the written entries before the pointer, so
-        // a recorder that loads the pointer finds both (see RecorderRing).
-        record.entries.store(ring, std::memory_order_release);
+        PublishRing(record, ring, cap);
     }
     return failed ? kLogInlineCapacity : cap;
 }
@@ -193,37 +170,13 @@ void tKPLogEngine::Reconfigure() {
 
 // --- recording -------------------------------------------------------------
 
-// One entry into the ring of the CPU the caller runs on. No lock, no
-// allocation, no atomic read-modify-write: one CPU query, word loads and
-// stores, and one store barrier (none on x86) before the index that publishes
-// the entry. Every shared word is read once and range-checked, so that a
-// racing Configure or read-out can tear an entry but never send the store
-// outside the ring; the check word lets the read-out recognise such a tear.
+// One entry into the ring of the CPU the caller runs on (see RecordEntry):
+// no lock, no allocation, no atomic read-modify-write.
 void tKPLogEngine::Record(const ClockTime& time, uint32_t event, uint32_t data) {
     if (enabled.load(kRelaxed) == 0) return;
     const uint32_t cpu = FoldCpuIndex(gLogCpuQuery(), cpuCount);
     const uint32_t bank = activeBank.load(kRelaxed) != 0 ? cpuCount : 0;
-    LogCpuRecord& record = records[bank + cpu];
-    const LogRing ring = RecorderRing(record);
-    if (ring.capacity == 0) return;
-
-    uint32_t slot = record.writeIndex.load(kRelaxed);
-    const bool wraps = slot >= ring.capacity;
-    if (wraps) slot = 0;
-    const uint32_t low = time.low;
-    const uint32_t high = time.high;
-    LogEntry& entry = ring.entries[slot];
-    entry.timeLow.store(low, kRelaxed);
-    entry.timeHigh.store(high, kRelaxed);
-    entry.event.store(event, kRelaxed);
-    entry.data.store(data, kRelaxed);
-    entry.check.store(LogEntryCheck(low, high, event, data), kRelaxed);
-    if (wraps) record.wrapCount.store(record.wrapCount.load(kRelaxed) + 1, kRelaxed);
-    // The entry first, then the index that makes it part of the ring: a
-    // read-out never takes a slot that was claimed but not yet written (it
-    // would still hold an entry of an earlier round, seconds old).
-    PublishFence();
-    record.writeIndex.store(slot + 1, kRelaxed);
+    RecordEntry(records[bank + cpu], time.low, time.high, event, data);
 }
 
 void tKPLogEngine::LogAt1(const ClockTime& time, uint32_t event) { Record(time, event, kLogNoData); }
