@@ -5,16 +5,20 @@
 # piece of source text and what it becomes. The mutants are applied one at a
 # time to a copy of the tree in build/mutation/src (the working tree itself is
 # never edited), built in build/mutation/build, and the fast tests are run
-# against each: the unit label first, then rt and integration (never long,
-# hostclock, tools, example, packaging or docs). A mutant is killed when a test
-# fails or hangs. Tests that already fail without any mutant are left out.
+# against each: the unit label first, then rt, integration and kext (never
+# long, hostclock, tools, example, packaging or docs). A mutant whose id begins
+# with `i686.` is a fault only a 32-bit target has: it is built for i686 in
+# build/mutation/build-i686 and run against the kext label there. A mutant is
+# killed when a test fails or hangs. Tests that already fail without any
+# mutant are left out.
 # The score is killed / (killed + survived); a mutant that does not compile is
 # reported and not counted.
 #
 # Usage: scripts/mutate.sh [--check] [--list] [--unit-only] [--only ID[,ID...]] [--jobs N]
 #   --check      only verify that every mutant's text occurs exactly once
 #   --list       print the mutants
-#   --unit-only  run the unit label only (quick, a lower bound of the score)
+#   --unit-only  run the unit label only (quick, a lower bound of the score;
+#                the i686 mutants are left out)
 #   --only       run the named mutants (and the baseline)
 #
 # Format of the list: `id @@ file @@ original text @@ mutated text`, one per
@@ -114,7 +118,7 @@ event.callback-without-service @@ engine/EventWaits.cpp @@ if (engine == nullptr
 event.own-semaphore-no-wait @@ engine/EventWaits.cpp @@ if (r == 0) end = WaitUntilMonotonic(node, ToU64(copy)); @@ (void)0;
 event.timeout-half @@ engine/EventWaits.cpp @@ const uint64_t deadline = ToU64(now) + clocks; @@ const uint64_t deadline = ToU64(now) + clocks / 2;
 event.stray-post-ends-wait @@ engine/EventWaits.cpp @@             case BlockResult::kTaken: break;  // a stray post: the deadline stands @@             case BlockResult::kTaken: return WaitEnd::kDue;
-event.global-early @@ engine/EventWaits.cpp @@ if (!Earlier(now, deadline)) return WaitEnd::kDue; @@ if (!Earlier(now, deadline) || node->fireCount.load() != 0) return WaitEnd::kDue;
+event.global-early @@ engine/EventWaits.cpp @@ if (Due(bound, now)) return WaitEnd::kDue; @@ if (Due(bound, now) || node->fireCount.load() != 0) return WaitEnd::kDue;
 # --- plain waits (engine/ClockWaits.cpp, engine/MicrosecondWaits.cpp) ---
 plain.next-multiple-32-at-once @@ engine/ClockWaits.cpp @@ multiple = ClockTime{now.low / period, 0};  // one 32-bit division @@ multiple = ClockTime{(now.low - 1) / period, 0};
 plain.next-multiple-32-one-more @@ engine/ClockWaits.cpp @@ multiple = ClockTime{now.low / period, 0};  // one 32-bit division @@ multiple = ClockTime{now.low / period + 1, 0};
@@ -155,6 +159,11 @@ semaphore.posts-unbounded @@ include/quelta/RuntimeSemaphore.h @@ if (s->count <
 semaphore.timed-out-takes @@ include/quelta/RuntimeSemaphore.h @@ result = abandoned ? 3 : rc == ETIMEDOUT ? 1 : 2; @@ result = abandoned ? 3 : rc == ETIMEDOUT ? 1 : 2;<NL>        if (s->count != 0 && !abandoned) { --s->count; result = 0; }
 # --- the stop (engine/LibraryUse.cpp) ---
 stop.unlisted-never-looks @@ engine/LibraryUse.cpp @@ r = WaitInSlices(semaphore, deadline); @@ r = PalSemaphoreWaitUntilUnless(semaphore, deadline, &Stopping);
+# --- the kernel extension's calls, through its emulation (tests/kext) ---
+kext.convert-time-first @@ engine/SystemClock.cpp @@ return syscall(number, static_cast<long>(fromClock), static_cast<long>(toClock), time); @@ return syscall(number, time, static_cast<long>(fromClock), static_cast<long>(toClock));
+kext.convert-direction-swapped @@ engine/EngineConversion.cpp @@ ConvertClockTime(CLOCK_MONOTONIC, CLOCK_REALTIME, &ts); @@ ConvertClockTime(CLOCK_REALTIME, CLOCK_MONOTONIC, &ts);
+kext.wake-wrong-id @@ source/os_extensions/nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.cpp @@ if (nr >= 1) return static_cast<int32_t>(syscall(nr, state.threadId.load())); @@ if (nr >= 1) return static_cast<int32_t>(syscall(nr, getpid()));
+i686.kext.convert-timespec-64 @@ engine/EngineConversion.cpp @@     KernelTimespec k{static_cast<long>(time->tv_sec), time->tv_nsec};<NL>    const long r = gSystemClock.convertTime(nr, fromClock, toClock, &k);<NL>    if (r == -1 && errno == EOVERFLOW) return false;<NL>    time->tv_sec = static_cast<time_t>(k.tv_sec);<NL>    time->tv_nsec = k.tv_nsec; @@     const long r = gSystemClock.convertTime(nr, fromClock, toClock, reinterpret_cast<KernelTimespec*>(time));<NL>    if (r == -1 && errno == EOVERFLOW) return false;
 # --- log engine (log/tKPLogEngine.cpp) ---
 log.adjust-not-atomic @@ log/tKPLogEngine.cpp @@ static_cast<uint32_t>(enableCount.fetch_add(delta, kRelaxed)) @@ static_cast<uint32_t>(enableCount.exchange(enableCount.load(kRelaxed) + delta, kRelaxed))
 EOF
@@ -165,7 +174,8 @@ selected() {
   mutants | grep -v '^\s*#' | grep -v '^\s*$' | awk -F ' @@ ' -v only="$only" '
     BEGIN { n = split(only, want, ","); for (i = 1; i <= n; i++) pick[want[i]] = 1 }
     { if (NF != 4) { print "malformed: " $0 > "/dev/stderr"; exit 2 }
-      if (only == "" || ($1 in pick)) printf "%s\t%s\t%s\t%s\n", $1, $2, $3, $4 }'
+      if (only == "" || ($1 in pick)) printf "%s\t%s\t%s\t%s\n", $1, $2, $3, $4 }' |
+    { if [ "$unit_only" = 1 ] && [ "$check_only$list_only" = 00 ]; then grep -v '^i686\.'; else cat; fi; }
 }
 
 # Replaces the one occurrence of FROM by TO in file $1; exit 3 when FROM does
@@ -216,33 +226,43 @@ restore() {
 trap 'restore; rm -f "$scratch"; exit 130' INT TERM
 trap 'restore; rm -f "$scratch"' EXIT
 
-build() {
-  cmake --build "$work/build" -j "$jobs" >"$1" 2>&1
+build() {  # build directory, log
+  cmake --build "$1" -j "$jobs" >"$2" 2>&1
 }
-echo "configuring and building the copy in $work/build"
-# Optimised as the suite's own native stage, without debug information (it
-# would only slow down the many rebuilds).
-cmake -S "$work/src" -B "$work/build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
-  -DCMAKE_CXX_FLAGS_RELWITHDEBINFO="-O2 -DNDEBUG" -DCMAKE_C_FLAGS_RELWITHDEBINFO="-O2 -DNDEBUG" \
-  -DQUELTA_BUILD_BENCH=OFF -DQUELTA_BUILD_TOOLS=OFF >"$work/logs/configure.log" 2>&1 \
-  || { echo "configure failed: $work/logs/configure.log" >&2; exit 1; }
-build "$work/logs/baseline-build.log" || { echo "the unmutated tree does not build" >&2; exit 1; }
+# The build a mutant is made in: i686 for the i686 ones, native otherwise.
+dir_of() { case $1 in i686.*) echo "$work/build-i686" ;; *) echo "$work/build" ;; esac; }
+configure() {  # build directory, log name, extra cmake arguments...
+  local dir=$1 name=$2; shift 2
+  echo "configuring and building the copy in $dir"
+  # Optimised as the suite's own stages, without debug information (it would
+  # only slow down the many rebuilds).
+  cmake -S "$work/src" -B "$dir" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+    -DCMAKE_CXX_FLAGS_RELWITHDEBINFO="-O2 -DNDEBUG" -DCMAKE_C_FLAGS_RELWITHDEBINFO="-O2 -DNDEBUG" \
+    -DQUELTA_BUILD_BENCH=OFF -DQUELTA_BUILD_TOOLS=OFF "$@" >"$work/logs/configure-$name.log" 2>&1 \
+    || { echo "configure failed: $work/logs/configure-$name.log" >&2; exit 1; }
+  build "$dir" "$work/logs/baseline-build-$name.log" || { echo "the unmutated tree does not build ($name)" >&2; exit 1; }
+}
+configure "$work/build" native
+needs_i686=0
+selected | cut -f1 | grep -q '^i686\.' && needs_i686=1
+[ $needs_i686 = 1 ] && configure "$work/build-i686" i686 -DCMAKE_TOOLCHAIN_FILE="$work/src/cmake/i686-linux-gnu.cmake"
 
 # The 32-thread stress test runs 5 s per mutant instead of 20.
 export QUELTA_STRESS_SECONDS=${QUELTA_STRESS_SECONDS:-5}
-stages=(unit 'rt|integration')
+stages=(unit 'rt|integration|kext')
 [ $unit_only = 1 ] && stages=(unit)
+stages_of() { case $1 in "$work/build-i686") echo kext ;; *) echo "${stages[@]}" ;; esac; }
 stage_timeout() { [ "$1" = unit ] && echo 240 || echo 480; }
 
 # Runs one stage; prints the first failing test (or "timeout") and returns 1
-# when a test failed. $1 label regex, $2 log, $3 exclusion regex.
+# when a test failed. $1 label regex, $2 log, $3 exclusion regex, $4 build.
 run_stage() {
-  local label=$1 log=$2 exclude=$3 args=()
+  local label=$1 log=$2 exclude=$3 dir=$4 args=()
   [ -n "$exclude" ] && args=(-E "$exclude")
   # A mutant can turn a loop into a runaway that allocates without end: each
   # test gets 4 GB of address space, far more than any needs.
   (ulimit -v 4194304
-   timeout -k 10 "$(stage_timeout "$label")" ctest --test-dir "$work/build" -L "$label" -LE 'long|hostclock' \
+   timeout -k 10 "$(stage_timeout "$label")" ctest --test-dir "$dir" -L "$label" -LE 'long|hostclock' \
      --stop-on-failure --output-on-failure "${args[@]}") >>"$log" 2>&1
   local rc=$?
   if [ $rc -eq 124 ] || [ $rc -eq 137 ]; then echo timeout; return 1; fi
@@ -254,19 +274,25 @@ run_stage() {
   return 0
 }
 
-# Baseline: tests that fail without any mutant are left out of every run.
+# Baseline: tests that fail without any mutant are left out of every run
+# in that build. Prints the exclusion regex of build $1.
+baseline() {
+  local dir=$1 name label failing=()
+  name=$(basename "$dir")
+  for label in $(stages_of "$dir"); do
+    (ulimit -v 4194304; timeout -k 10 600 ctest --test-dir "$dir" -L "$label" -LE 'long|hostclock') \
+      >"$work/logs/baseline-$name-$([ "$label" = unit ] && echo unit || echo rest).log" 2>&1
+  done
+  while read -r t; do failing+=("$t"); done < <(sed -n 's/.*Test *#[0-9]*: \([^ ]*\) .*\*\*\*.*/\1/p' "$work"/logs/baseline-"$name"-*.log)
+  if [ ${#failing[@]} -gt 0 ]; then
+    echo "left out in $name (failing without a mutant): ${failing[*]}" >&2
+    echo "^($(IFS='|'; echo "${failing[*]}"))\$"
+  fi
+}
 echo "baseline run (tests that fail here are left out)"
-failing=()
-for label in "${stages[@]}"; do
-  (ulimit -v 4194304; timeout -k 10 600 ctest --test-dir "$work/build" -L "$label" -LE 'long|hostclock') \
-    >"$work/logs/baseline-$([ "$label" = unit ] && echo unit || echo rest).log" 2>&1
-done
-while read -r t; do failing+=("$t"); done < <(sed -n 's/.*Test *#[0-9]*: \([^ ]*\) .*\*\*\*.*/\1/p' "$work"/logs/baseline-*.log)
-exclude=""
-if [ ${#failing[@]} -gt 0 ]; then
-  exclude="^($(IFS='|'; echo "${failing[*]}"))\$"
-  echo "left out (failing without a mutant): ${failing[*]}"
-fi
+exclude=$(baseline "$work/build")
+exclude_i686=""
+[ $needs_i686 = 1 ] && exclude_i686=$(baseline "$work/build-i686")
 
 killed=0 survived=0 invalid=0
 report=$work/report.txt
@@ -276,12 +302,14 @@ while IFS=$'\t' read -r id file from to; do
   cp "$work/src/$file" "$work/original"
   current=$file
   FROM=$from TO=$to replace_once "$work/src/$file"
-  if ! build "$log"; then
+  dir=$(dir_of "$id")
+  excluded=$exclude; [ "$dir" = "$work/build" ] || excluded=$exclude_i686
+  if ! build "$dir" "$log"; then
     result="does-not-compile"; invalid=$((invalid + 1))
   else
     result=""
-    for label in "${stages[@]}"; do
-      if killer=$(run_stage "$label" "$log" "$exclude"); then continue; fi
+    for label in $(stages_of "$dir"); do
+      if killer=$(run_stage "$label" "$log" "$excluded" "$dir"); then continue; fi
       result="killed by $killer"; break
     done
     if [ -z "$result" ]; then result="SURVIVED"; survived=$((survived + 1)); else killed=$((killed + 1)); fi
@@ -290,7 +318,9 @@ while IFS=$'\t' read -r id file from to; do
   printf '%-34s %s\n' "$id" "$result" | tee -a "$report"
 done < <(selected)
 
-build "$work/logs/restore-build.log"  # leave the copy's build matching the tree
+# Leave the copy's builds matching the tree.
+build "$work/build" "$work/logs/restore-build.log"
+[ $needs_i686 = 1 ] && build "$work/build-i686" "$work/logs/restore-build-i686.log"
 counted=$((killed + survived))
 if [ $counted -gt 0 ]; then
   score=$(awk -v k=$killed -v n=$counted 'BEGIN { printf "%.1f", 100 * k / n }')
