@@ -122,12 +122,15 @@ void TickServiceRoutine() {
     for (;;) {
         // Before the lock: the reading, its global equivalent, and the global
         // callback time on the monotonic clock (NeverTime cancels: it is
-        // neither converted nor folded).
+        // neither converted nor folded). The global clock is consulted only
+        // while something waits on it, so a pass at rest (the tick alone)
+        // makes no conversion.
         const uint64_t now = ReadNow(engine);
         const ClockTime nowTime = FromU64(now);
-        const uint64_t nowGlobal = ToU64(slots->MonotonicToGlobal(nowTime));
-        const int64_t offset = GlobalOffsetOf(now, nowGlobal);
         const uint64_t globalTime = gGlobalCallbackTime.Load();
+        const bool needGlobal = !IsNever(globalTime) || GlobalNodesQueued();
+        const uint64_t nowGlobal = needGlobal ? ToU64(slots->MonotonicToGlobal(nowTime)) : now;
+        const int64_t offset = GlobalOffsetOf(now, nowGlobal);
         const bool globalDue = Due(globalTime, nowGlobal);
         uint64_t globalAsMonotonic = kNeverTime64;
         if (!globalDue && !IsNever(globalTime)) globalAsMonotonic = ToU64(slots->GlobalToMonotonic(FromU64(globalTime)));
@@ -136,6 +139,7 @@ void TickServiceRoutine() {
         work.fired = 0;
         {
             SchedLockGuard lock;
+            if (!needGlobal && GlobalNodesQueued()) continue;  // one arrived meanwhile: convert first
             gNextDeadline.Store(kNeverTime64);
             work.tickDue = ServeTickLocked(engine, now);
 

@@ -65,6 +65,7 @@ void UnlinkQueued(WaitNode* node) {
         prev->next.store(next, std::memory_order_release);
         if (next != nullptr) next->prev.store(prev, kRelaxed);
     }
+    gWaitListVersion.fetch_add(1, std::memory_order_release);
     CountQueued(node, -1);
 }
 
@@ -75,40 +76,49 @@ void PushFree(WaitNode* node) {
     gFreeList.store(node, kRelaxed);
 }
 
-// Links `node` into the wait list in deadline order, behind every node whose
-// effective deadline (global ones at `offset`) is not later than its own.
-// Lock held; each step is a comparison of two numbers.
-void LinkSorted(WaitNode* node, int64_t offset) {
-    WaitNode* head = gWaitList.load(kRelaxed);
+// Where an insert links its node, found by a walk made before the lock is
+// taken, so that the lock is held for the link alone and the timer thread
+// never waits on it for a caller's walk. The walk reads a list that may
+// change under it; every change of the list's shape moves gWaitListVersion
+// (with the lock held, after the change), so the place is right when the
+// version still reads the same under the lock, and is found again there
+// otherwise.
+struct Placement {
+    bool found;
+    uint32_t version;
+    WaitNode* after;  // the node to link behind; null: as the head
+};
+
+Placement FindPlacement(const WaitNode* node, int64_t offset) {
+    Placement place{false, gWaitListVersion.load(std::memory_order_acquire), nullptr};
     const uint64_t own = EffectiveDeadline(node, offset);
-    if (head == nullptr) {
-        node->next.store(nullptr, kRelaxed);
-        gWaitList.store(node, std::memory_order_release);
-    } else if (Earlier(own, EffectiveDeadline(head, offset))) {
-        node->next.store(head, kRelaxed);
-        head->prev.store(node, kRelaxed);
-        gWaitList.store(node, std::memory_order_release);
-    } else {
-        WaitNode* current = head;
-        for (;;) {
-            WaitNode* following = current->next.load(kRelaxed);
-            if (following == nullptr) {
-                node->prev.store(current, kRelaxed);
-                node->next.store(nullptr, kRelaxed);
-                current->next.store(node, std::memory_order_release);
-                break;
-            }
-            if (Earlier(own, EffectiveDeadline(following, offset))) {
-                node->prev.store(current, kRelaxed);
-                node->next.store(following, kRelaxed);
-                following->prev.store(node, kRelaxed);
-                current->next.store(node, std::memory_order_release);
-                break;
-            }
-            current = following;
-        }
+    WaitNode* current = gWaitList.load(std::memory_order_acquire);
+    for (uint32_t steps = 0; current != nullptr; ++steps) {
+        if (steps == kWaitNodeCount) return place;  // led astray by changes: walk under the lock
+        if (Earlier(own, EffectiveDeadline(current, offset))) break;
+        place.after = current;
+        current = current->next.load(std::memory_order_acquire);
     }
-    gWaitListVersion.fetch_add(1, kRelaxed);
+    place.found = true;
+    return place;
+}
+
+// Links `node` into the wait list in deadline order, behind every node whose
+// effective deadline (global ones at `offset`) is not later than its own: at
+// `place` when the list has not changed since it was found, else at the
+// place a walk finds now. Lock held.
+void LinkSorted(WaitNode* node, int64_t offset, Placement place) {
+    if (!place.found || place.version != gWaitListVersion.load(kRelaxed)) place = FindPlacement(node, offset);
+    WaitNode* following = place.after != nullptr ? place.after->next.load(kRelaxed) : gWaitList.load(kRelaxed);
+    node->prev.store(place.after, kRelaxed);
+    node->next.store(following, kRelaxed);
+    if (following != nullptr) following->prev.store(node, kRelaxed);
+    if (place.after != nullptr) {
+        place.after->next.store(node, std::memory_order_release);
+    } else {
+        gWaitList.store(node, std::memory_order_release);
+    }
+    gWaitListVersion.fetch_add(1, std::memory_order_release);
     CountQueued(node, +1);
     node->state.store(static_cast<uint32_t>(NodeState::kQueued), kRelaxed);
 }
@@ -205,14 +215,21 @@ constexpr int kLockSpins = 32;
 
 }  // namespace
 
+// The timer is armed under the lock, but woken only once it is released
+// (see BeginDeferringTimerWakes): the timer thread, woken, may need the lock
+// at once.
 SchedLockGuard::SchedLockGuard() {
+    BeginDeferringTimerWakes();
     for (int i = 0; i < kLockSpins; ++i) {
         if (pthread_mutex_trylock(&gSchedLock) == 0) return;
         CpuRelax();
     }
     pthread_mutex_lock(&gSchedLock);
 }
-SchedLockGuard::~SchedLockGuard() { pthread_mutex_unlock(&gSchedLock); }
+SchedLockGuard::~SchedLockGuard() {
+    pthread_mutex_unlock(&gSchedLock);
+    EndDeferringTimerWakes();
+}
 
 int64_t GlobalOffset(uint64_t* monotonicOut) {
     timespec ts{};
@@ -224,6 +241,8 @@ int64_t GlobalOffset(uint64_t* monotonicOut) {
     iKPusTimingEngine* e = engine;
     return GlobalOffsetOf(monotonic, ToU64(e->MonotonicToGlobal(FromU64(monotonic))));
 }
+
+bool GlobalNodesQueued() { return gQueuedGlobalNodes.load(kRelaxed) != 0; }
 
 uint64_t GlobalToMonotonicAt(uint64_t g, int64_t offset) {
     if (IsNever(g)) return kNeverTime64;
@@ -316,6 +335,7 @@ uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
     bool needOffset = node->isGlobal.load(kRelaxed) != 0 || gQueuedGlobalNodes.load(kRelaxed) != 0;
     for (;;) {
         const int64_t offset = needOffset ? GlobalOffset() : 0;
+        const Placement place = FindPlacement(node, offset);
         SchedLockGuard lock;
         if (!needOffset && gQueuedGlobalNodes.load(kRelaxed) != 0) {
             needOffset = true;  // a global node arrived meanwhile: measure, then place
@@ -326,7 +346,7 @@ uint32_t InsertWaitNode(WaitNode* node, const ClockTime* deadline,
         // whatever its deadline instead of letting its waiter hang.
         if (TimerServing()) {
             if (needOffset) NotePlacementOffset(offset);
-            LinkSorted(node, offset);
+            LinkSorted(node, offset, place);
             queued = true;
             // Armed for whenever it is earlier than the armed time, head or
             // not: a head whose holder wakes by itself left the timer for

@@ -112,6 +112,10 @@ inline int64_t GlobalOffsetOf(uint64_t monotonic, uint64_t global) {
     return static_cast<int64_t>(global - monotonic);
 }
 
+// True while global-clock nodes are queued (exact under gSchedLock; a hint
+// without it).
+bool GlobalNodesQueued();
+
 // The monotonic time of global time `g` at `offset`, as the scheduler reads
 // it: NeverTime stays NeverTime; a time that comes before the global zero in
 // the library's order (high word 0xFFFFFFFF), or that lies before the

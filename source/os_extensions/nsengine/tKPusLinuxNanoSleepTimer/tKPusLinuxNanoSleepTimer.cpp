@@ -39,6 +39,12 @@ uint32_t gAlarmUsers = 0;
 // kernel for the thread id on every re-arm.
 thread_local const TimerThreadState* tCurrentTimerState = nullptr;
 
+// This thread's deferred wakes (see BeginDeferringTimerWakes): whether it
+// defers now, and the wakes it owes (to one timer: the library has one).
+thread_local bool tDeferring = false;
+thread_local tKPusLinuxNanoSleepTimer* tOwedTimer = nullptr;
+thread_local uint32_t tOwedWakes = 0;
+
 void SleepNs(long ns) {
     timespec ts{0, ns};
     nanosleep(&ts, nullptr);
@@ -101,6 +107,12 @@ PalSleepResult BoundedNanosleepUntil(TimerThreadState& state, uint32_t takenCoun
         }
         const timespec until = Earliest(deadline, bound);
         const PalSleepResult result = NanosleepUntil(state, until, kernelWake);
+        if (result == PalSleepResult::kWoken) {
+            // A wake made after its expiry was taken (or not meant for us)
+            // brings nothing new: sleep on to the same deadline.
+            if (ExpirySetSince(state, takenCount)) return result;
+            continue;
+        }
         if (result != PalSleepResult::kDeadline) return result;
         if (until.tv_sec == deadline.tv_sec && until.tv_nsec == deadline.tv_nsec) return result;
         if (ExpirySetSince(state, takenCount)) return PalSleepResult::kWoken;
@@ -209,39 +221,79 @@ int32_t tKPusLinuxNanoSleepTimer::Initialize(QueltaExpiryCallbackFn callback) {
 
 void tKPusLinuxNanoSleepTimer::NoOperation() {}
 
-void tKPusLinuxNanoSleepTimer::SetExpiry(ClockTime when) {
+bool tKPusLinuxNanoSleepTimer::StoreExpiryLocked(ClockTime when) {
     const uint64_t ns = (static_cast<uint64_t>(when.high) << 32) | when.low;
     const uint64_t seconds = ns / kNsPerSecond;
-
-    pthread_mutex_lock(&state.expiryLock);
     ++state.setCount;
     state.expiry.tv_sec = static_cast<int32_t>(static_cast<uint32_t>(seconds));
     state.expiry.tv_nsec = static_cast<int32_t>(ns - seconds * kNsPerSecond);
+    return state.threadId.load() >= 0 && !OnTimerThread();
+}
 
+namespace {
+
+// The thread sleeps on its wake word (the stand-in for the kernel's call).
+bool UsesWakeWord() {
+    return gWakeSyscallNr.load(std::memory_order_relaxed) < 1 &&
+           gPalWakeStandInEnabled.load(std::memory_order_relaxed);
+}
+
+}  // namespace
+
+void tKPusLinuxNanoSleepTimer::WakeByCallOrSignal() {
+    if (WakeTimerThread(state) != kNoSyscall) return;
+    if (gWakeWarningShown.exchange(1) == 0) {
+        std::printf(
+            "Warning: using sched_wake_up system call %d failed!\n"
+            "This could lead to degraded nanosecond engine performance.\n",
+            static_cast<int>(gWakeSyscallNr.load()));
+        std::fflush(stdout);
+    }
+    pthread_kill(thread, SIGALRM);
+}
+
+void tKPusLinuxNanoSleepTimer::SetExpiry(ClockTime when) {
     // Wake the thread while still holding the lock: it cannot take the new
     // value without also seeing the wake. The stand-in's wake word moves
     // here (the thread snapshots it under this lock) and its sleepers are
     // notified once the lock is free; the kernel call and the signal act on
     // the sleep itself, so they are made here.
+    // A thread deferring its wakes only moves the wake word here (a sleep
+    // begun from now on is refused) and makes the rest of the wake later.
+    pthread_mutex_lock(&state.expiryLock);
     bool notify = false;
-    if (state.threadId.load() >= 0 && !OnTimerThread()) {
-        if (gWakeSyscallNr.load(std::memory_order_relaxed) < 1 &&
-            gPalWakeStandInEnabled.load(std::memory_order_relaxed)) {
+    if (StoreExpiryLocked(when)) {
+        if (tDeferring) {
+            if (UsesWakeWord()) PalWakeMove(state.wakeWord);
+            deferredWakes_.fetch_add(1, std::memory_order_relaxed);
+            tOwedTimer = this;
+            ++tOwedWakes;
+        } else if (UsesWakeWord()) {
             PalWakeMove(state.wakeWord);
             notify = true;
-        } else if (WakeTimerThread(state) == kNoSyscall) {
-            if (gWakeWarningShown.exchange(1) == 0) {
-                std::printf(
-                    "Warning: using sched_wake_up system call %d failed!\n"
-                    "This could lead to degraded nanosecond engine performance.\n",
-                    static_cast<int>(gWakeSyscallNr.load()));
-                std::fflush(stdout);
-            }
-            pthread_kill(thread, SIGALRM);
+        } else {
+            WakeByCallOrSignal();
         }
     }
     pthread_mutex_unlock(&state.expiryLock);
     if (notify) PalWakeNotify(state.wakeWord);
+}
+
+void tKPusLinuxNanoSleepTimer::WakeDeferred() {
+    if (UsesWakeWord()) {
+        PalWakeNotify(state.wakeWord);
+    } else {
+        WakeByCallOrSignal();
+    }
+    deferredWakes_.fetch_sub(1, std::memory_order_release);
+}
+
+void BeginDeferringTimerWakes() { tDeferring = true; }
+
+void EndDeferringTimerWakes() {
+    tDeferring = false;
+    for (; tOwedWakes != 0; --tOwedWakes) tOwedTimer->WakeDeferred();
+    tOwedTimer = nullptr;
 }
 
 void tKPusLinuxNanoSleepTimer::ExpireNow() { SetExpiry(ClockTime{0, 0}); }
@@ -255,6 +307,9 @@ bool tKPusLinuxNanoSleepTimer::IsServing() const {
 bool tKPusLinuxNanoSleepTimer::OnTimerThread() const { return tCurrentTimerState == &state; }
 
 tKPusLinuxNanoSleepTimer::~tKPusLinuxNanoSleepTimer() {
+    // Nobody can owe a new wake by now (the timer is unreachable); the
+    // wakes owed already are made within moments.
+    while (deferredWakes_.load(std::memory_order_acquire) != 0) SleepNs(kJoinPollNs);
     if (thread != 0) {
         state.stopRequested.store(1);
         // A thread parked on the far deadline would otherwise keep the join

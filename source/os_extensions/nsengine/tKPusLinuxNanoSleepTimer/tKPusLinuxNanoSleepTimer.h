@@ -117,8 +117,31 @@ public:
     pthread_attr_t threadAttr;
 
 private:
+    friend void EndDeferringTimerWakes();
+
+    // Stores `when` as the next expiry; true when another thread than the
+    // timer's own must wake it. expiryLock held.
+    bool StoreExpiryLocked(ClockTime when);
+    // Ends the thread's sleep by the kernel's call, or by SIGALRM (with the
+    // warning, once) when the call is unavailable.
+    void WakeByCallOrSignal();
+    // Makes one wake that a SetExpiry deferred.
+    void WakeDeferred();
+
     bool actionInstalled_ = false;
+    // Wakes deferred and not yet made; the timer is not destroyed while any
+    // is owed.
+    std::atomic<uint32_t> deferredWakes_{0};
 };
+
+// A thread that holds a lock the timer thread needs (the scheduler's)
+// brackets the hold with these: a SetExpiry it makes meanwhile stores the
+// expiry at once but leaves the wake (a system call) until the End, made
+// after the lock is released, so that the timer thread never waits on that
+// lock for it. A late wake, one that finds its expiry already taken, ends
+// nothing: the thread sleeps on (see isrthread). Not nested.
+void BeginDeferringTimerWakes();
+void EndDeferringTimerWakes();
 
 // Number of the wake-up system call: 0 not read yet, -1 none.
 extern std::atomic<int32_t> gWakeSyscallNr;
