@@ -137,38 +137,29 @@ private:
         return static_cast<int>(fd);
     }
 
-    static bool SendFd(int socket, int fd) {
+    // One byte carrying one descriptor (SCM_RIGHTS).
+    struct FdMessage {
         char data = 'L';
         iovec iov{&data, 1};
         alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-        msghdr msg{};
-        msg.msg_iov = &iov;
-        msg.msg_iovlen = 1;
-        msg.msg_control = control;
-        msg.msg_controllen = sizeof control;
-        cmsghdr* c = CMSG_FIRSTHDR(&msg);
-        c->cmsg_level = SOL_SOCKET;
-        c->cmsg_type = SCM_RIGHTS;
-        c->cmsg_len = CMSG_LEN(sizeof(int));
-        std::memcpy(CMSG_DATA(c), &fd, sizeof fd);
-        return sendmsg(socket, &msg, 0) == 1;
+        msghdr msg{nullptr, 0, &iov, 1, control, sizeof control, 0};
+        cmsghdr* header() { return CMSG_FIRSTHDR(&msg); }
+    };
+    static bool SendFd(int socket, int fd) {
+        FdMessage m;
+        *m.header() = cmsghdr{CMSG_LEN(sizeof(int)), SOL_SOCKET, SCM_RIGHTS};
+        std::memcpy(CMSG_DATA(m.header()), &fd, sizeof fd);
+        return sendmsg(socket, &m.msg, 0) == 1;
     }
 
     // The supervisor process: never returns.
     [[noreturn]] void RunSupervisor(int socket, pid_t parent) {
         prctl(PR_SET_PDEATHSIG, SIGKILL);
         if (getppid() != parent) _exit(0);
-        char data;
-        iovec iov{&data, 1};
-        alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-        msghdr msg{};
-        msg.msg_iov = &iov;
-        msg.msg_iovlen = 1;
-        msg.msg_control = control;
-        msg.msg_controllen = sizeof control;
-        if (recvmsg(socket, &msg, 0) != 1 || CMSG_FIRSTHDR(&msg) == nullptr) _exit(1);
+        FdMessage m;
         int listener;
-        std::memcpy(&listener, CMSG_DATA(CMSG_FIRSTHDR(&msg)), sizeof listener);
+        if (recvmsg(socket, &m.msg, 0) != 1 || m.header() == nullptr) _exit(1);
+        std::memcpy(&listener, CMSG_DATA(m.header()), sizeof listener);
         sched_param p{};
         p.sched_priority = sched_get_priority_max(SCHED_FIFO);
         sched_setscheduler(0, SCHED_FIFO, &p);  // when allowed: wakes and deadlines are served first

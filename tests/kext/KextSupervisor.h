@@ -95,25 +95,20 @@ private:
 
     // --- replies ---------------------------------------------------------------
     bool Reply(uint64_t id, int64_t val, int32_t error, uint32_t flags = 0) {
-        seccomp_notif_resp r{};
-        r.id = id;
-        r.val = val;
-        r.error = error;
-        r.flags = flags;
+        seccomp_notif_resp r{id, val, error, flags};
         return ioctl(fd_, SECCOMP_IOCTL_NOTIF_SEND, &r) == 0;
     }
     void Continue(uint64_t id) { Reply(id, 0, 0, SECCOMP_USER_NOTIF_FLAG_CONTINUE); }
     bool Valid(uint64_t id) { return ioctl(fd_, SECCOMP_IOCTL_NOTIF_ID_VALID, &id) == 0; }
 
     // --- target memory -----------------------------------------------------------
-    bool Read(int pid, uint64_t addr, void* out, size_t n) {
-        iovec local{out, n}, remote{reinterpret_cast<void*>(static_cast<uintptr_t>(addr)), n};
-        return process_vm_readv(pid, &local, 1, &remote, 1, 0) == static_cast<ssize_t>(n);
+    static bool Transfer(int pid, uint64_t addr, void* buffer, size_t n, bool write) {
+        iovec local{buffer, n}, remote{reinterpret_cast<void*>(static_cast<uintptr_t>(addr)), n};
+        const ssize_t done = write ? process_vm_writev(pid, &local, 1, &remote, 1, 0)
+                                   : process_vm_readv(pid, &local, 1, &remote, 1, 0);
+        return done == static_cast<ssize_t>(n);
     }
-    bool Write(int pid, uint64_t addr, const void* in, size_t n) {
-        iovec local{const_cast<void*>(in), n}, remote{reinterpret_cast<void*>(static_cast<uintptr_t>(addr)), n};
-        return process_vm_writev(pid, &local, 1, &remote, 1, 0) == static_cast<ssize_t>(n);
-    }
+    static bool Read(int pid, uint64_t addr, void* out, size_t n) { return Transfer(pid, addr, out, n, false); }
     // A timespec of the target: 32-bit fields, or 64-bit ones (of which the
     // kernel reads only the low half of tv_nsec for a 32-bit caller).
     bool ReadTimespec(int pid, uint64_t addr, bool narrow, bool compat, int64_t& sec, int64_t& nsec) {
@@ -172,23 +167,19 @@ private:
         it.it_value.tv_nsec = static_cast<long>(earliest % 1000000000);
         timerfd_settime(timer_, TFD_TIMER_ABSTIME, &it, nullptr);  // 0: disarmed
     }
-    void Drop(Sleep& s) {
-        page_->Add(kSleepsInterrupted);
+    // Ends a listed sleep: answered, or found ended by a signal.
+    void End(Sleep& s, bool answered) {
+        if (!answered) page_->Add(kSleepsInterrupted);
         s = Sleep{};
+        ArmTimerFd();
     }
     void ExpireSleeps() {
         uint64_t ticks;
         (void)!read(timer_, &ticks, sizeof ticks);
         const int64_t now = NowNs(CLOCK_MONOTONIC);
         for (Sleep& s : sleeps_) {
-            if (s.tid == 0 || s.deadline > now) continue;
-            if (Reply(s.id, 0, 0)) {
-                s = Sleep{};
-            } else {
-                Drop(s);  // the thread took a signal meanwhile
-            }
+            if (s.tid != 0 && s.deadline <= now) End(s, Reply(s.id, 0, 0));
         }
-        ArmTimerFd();
     }
 
     void HandleSleep(const seccomp_notif& n, const ArchCalls& a) {
@@ -205,7 +196,7 @@ private:
         if ((n.data.args[1] & TIMER_ABSTIME) == 0) deadline += now;
         // A thread is in one call at a time: an earlier sleep of it that is
         // still listed was ended by a signal.
-        if (Sleep* old = SleepOf(tid)) Drop(*old);
+        if (Sleep* old = SleepOf(tid)) End(*old, false);
         if (deadline <= now) return (void)Reply(n.id, 0, 0);
         Sleep* slot = SleepOf(0);
         if (slot == nullptr) return Continue(n.id);  // more timers than slots: let it sleep for real
@@ -227,12 +218,7 @@ private:
         if (s != nullptr && page_->loseEveryWake.load(std::memory_order_relaxed) == 0 &&
             NowNs(CLOCK_MONOTONIC) - s->arrived >= widen) {
             delivered = Valid(s->id) && Reply(s->id, -1, -EAGAIN);
-            if (delivered) {
-                *s = Sleep{};
-                ArmTimerFd();
-            } else {
-                Drop(*s);
-            }
+            End(*s, delivered);
         }
         page_->Add(delivered ? kWakesDelivered : kWakesLost);
         Reply(n.id, 0, 0);
@@ -256,16 +242,13 @@ private:
         const int64_t ns = sec * 1000000000 + nsec - OffsetOf(static_cast<int>(from)) + OffsetOf(static_cast<int>(to));
         int64_t outSec = ns / 1000000000, outNsec = ns % 1000000000;
         if (outNsec < 0) outNsec += 1000000000, outSec -= 1;
-        bool written;
-        if (a.narrowLong) {
-            if (outSec != static_cast<int32_t>(outSec)) return EOVERFLOW;
-            const int32_t t[2] = {static_cast<int32_t>(outSec), static_cast<int32_t>(outNsec)};
-            written = Valid(n.id) && Write(pid, n.data.args[2], t, sizeof t);
-        } else {
-            const int64_t t[2] = {outSec, outNsec};
-            written = Valid(n.id) && Write(pid, n.data.args[2], t, sizeof t);
+        if (a.narrowLong && outSec != static_cast<int32_t>(outSec)) return EOVERFLOW;
+        int64_t wide[2] = {outSec, outNsec};
+        int32_t narrow[2] = {static_cast<int32_t>(outSec), static_cast<int32_t>(outNsec)};
+        void* out = a.narrowLong ? static_cast<void*>(narrow) : static_cast<void*>(wide);
+        if (!Valid(n.id) || !Transfer(pid, n.data.args[2], out, a.narrowLong ? sizeof narrow : sizeof wide, true)) {
+            return EFAULT;
         }
-        if (!written) return EFAULT;
         page_->Add(from == CLOCK_MONOTONIC && to == CLOCK_REALTIME   ? kConvertMonoToReal
                    : from == CLOCK_REALTIME && to == CLOCK_MONOTONIC ? kConvertRealToMono
                                                                      : kConvertOther);
@@ -288,8 +271,7 @@ private:
     }
 
     void HandleOne() {
-        alignas(8) unsigned char buffer[512] = {};  // zeroed, as the kernel requires
-        seccomp_notif& n = *reinterpret_cast<seccomp_notif*>(buffer);
+        seccomp_notif n{};  // zeroed, as the kernel requires
         if (ioctl(fd_, SECCOMP_IOCTL_NOTIF_RECV, &n) != 0) return;  // the target was interrupted
         const ArchCalls* a = nullptr;
         for (const ArchCalls& c : kArchs) {

@@ -28,23 +28,23 @@ public:
     Watchdog(const char* what, uint64_t limitNs)
         : thread_([this, what, limitNs] {
               std::unique_lock<std::mutex> lock(mutex_);
-              if (cv_.wait_for(lock, std::chrono::nanoseconds(limitNs), [this] { return done_; })) return;
+              if (done_.wait_for(lock, std::chrono::nanoseconds(limitNs), [this] { return ended_; })) return;
               std::fprintf(stderr, "FAILED: %s did not end within %.1f s\n", what, limitNs / 1e9);
               std::_Exit(1);
           }) {}
     ~Watchdog() {
         {
             std::lock_guard<std::mutex> lock(mutex_);
-            done_ = true;
+            ended_ = true;
         }
-        cv_.notify_one();
+        done_.notify_one();
         thread_.join();
     }
 
 private:
     std::mutex mutex_;
-    std::condition_variable cv_;
-    bool done_ = false;
+    std::condition_variable done_;
+    bool ended_ = false;  // guarded by mutex_
     std::thread thread_;  // last: starts once the rest is built
 };
 

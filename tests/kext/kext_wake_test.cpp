@@ -2,6 +2,7 @@
 // between ticks are served through it, its failure (38) falls back to
 // SIGALRM with one warning, and a wake the kernel loses costs at most a tick.
 #include <algorithm>
+#include <vector>
 
 #include "KextSandbox.h"
 #include "KextTestSupport.h"
@@ -130,8 +131,7 @@ TEST_P(KextWindow, ADeadlineSetInTheWindowIsServedWithinATick) {
     Page().loseEveryWake.store(GetParam().loseEveryWake);
     Page().widenWindowUs.store(GetParam().widenUs);
     Counts d{};
-    uint64_t worst = 0;
-    int count = 0;
+    std::vector<uint64_t> late;
     for (int load = 0; load < 3; ++load) {
         const Counts before = Page().Snapshot();
         LoadedLibrary lib;
@@ -142,17 +142,21 @@ TEST_P(KextWindow, ADeadlineSetInTheWindowIsServedWithinATick) {
             const uint64_t end = CallbackAfter(lib, 200 * kUs, deadline);
             ASSERT_NE(end, 0u) << "callback " << i << " after start-up never ran: the timer thread stays parked";
             EXPECT_GE(end, deadline);
-            worst = std::max(worst, end - deadline);
-            ++count;
+            late.push_back(end - deadline);
         }
         const Counts part = Since(before, Page().Snapshot());  // the unload's wake left out
         for (int c = 0; c < kCounterCount; ++c) d[c] += part[c];
     }
-    std::printf("window [%s]: %d deadlines, %lld wakes lost, %lld delivered, worst lateness %.0f us\n",
-                GetParam().name, count, static_cast<long long>(d[kWakesLost]),
-                static_cast<long long>(d[kWakesDelivered]), worst / 1e3);
+    std::sort(late.begin(), late.end());
+    const uint64_t median = late[late.size() / 2], worst = late.back();
+    std::printf("window [%s]: %zu deadlines, %lld wakes lost, %lld delivered, lateness median %.0f us, worst %.0f us\n",
+                GetParam().name, late.size(), static_cast<long long>(d[kWakesLost]),
+                static_cast<long long>(d[kWakesDelivered]), median / 1e3, worst / 1e3);
     EXPECT_GT(d[kWakesLost], 0) << "the sweep never hit the window";
-    EXPECT_LT(worst, 1 * kMs + 20 * kMs) << "one tick plus a loose margin";
+    // A lost wake costs a tick: the worst case with a loose margin for the
+    // machine's own spikes, and the typical case within two ticks.
+    EXPECT_LT(worst, 1 * kMs + 50 * kMs);
+    EXPECT_LT(median, 2 * kMs);
 }
 
 INSTANTIATE_TEST_SUITE_P(Knobs, KextWindow,
