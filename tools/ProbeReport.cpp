@@ -44,6 +44,8 @@ void FinishVerdicts(ProbeReport& report) {
                                                                        : std::numeric_limits<double>::quiet_NaN())
                          : RatioP99(s.summary, b);
         s.verdict = s.measured ? VerdictFor(s.summary, b, isBase, s.failed) : "not measured: " + s.notMeasured;
+        s.stallExplains = -1;
+        if (s.measured) s.verdict += StallClause(s.summary, b, s.stall, isBase, s.stallExplains);
     }
 }
 
@@ -98,9 +100,28 @@ std::string ReportToJson(const ProbeReport& r) {
                           {"early", m.early},
                           {"failed", s.failed},
                           {"over_1ms", s.overMs},
-                          {"over_1ms_cpu_held", s.cpuHeld >= 0 ? json(s.cpuHeld) : json(nullptr)}});
+                          {"over_1ms_cpu_held", s.cpuHeld >= 0 ? json(s.cpuHeld) : json(nullptr)},
+                          {"machine_stall_count", s.stall.count},
+                          {"machine_stall_p99", number(s.stall.p99)},
+                          {"machine_stall_max", number(s.stall.max)},
+                          {"machine_stalls_explain_tail",
+                           s.stallExplains < 0 ? json(nullptr) : json(s.stallExplains == 1)}});
     }
     doc["series"] = std::move(series);
+    const NoiseResult& n = r.noise;
+    const bool on = n.mode != "off";
+    doc["machine_noise"] = {
+        {"mode", n.mode},
+        {"cpu", n.cpu >= 0 ? json(n.cpu) : json(nullptr)},
+        {"threshold_us", on ? number(n.thresholdUs) : json(nullptr)},
+        {"window_us", n.mode == "windows" ? number(n.windowUs) : json(nullptr)},
+        {"measured_s", number(n.measuredS)},
+        {"stalls", n.stalls},
+        {"stalled_fraction", n.measuredS > 0 ? number(n.stalledUs / (n.measuredS * 1e6), 1e6) : json(nullptr)},
+        {"library_timer_us", n.libraryUs >= 0 ? number(n.libraryUs) : json(nullptr)},
+        {"stall_p50", number(n.longest.p50)},
+        {"stall_p99", number(n.longest.p99)},
+        {"stall_max", number(n.longest.max)}};
     json costs = json::array();
     for (const CostResult& c : r.costs) {
         json cost = {{"name", c.name},
@@ -116,25 +137,50 @@ std::string ReportToJson(const ProbeReport& r) {
 }
 
 std::string FormatSeriesTable(const ProbeReport& r) {
-    const char* heads[] = {"series", "count", "min", "p50", "p90", "p99", "p99.9", "max", "p99/base", "verdict"};
+    const char* heads[] = {"series", "count",    "min",       "p50",       "p90",    "p99",
+                           "p99.9",  "max",      "p99/base", "stall p99", "stall max", "verdict"};
     std::vector<std::vector<std::string>> rows;
     rows.push_back(std::vector<std::string>(std::begin(heads), std::end(heads)));
     for (const SeriesResult& s : r.series) {
         const Summary& m = s.summary;
         rows.push_back({s.name, std::to_string(m.count), Cell(m.min), Cell(m.p50), Cell(m.p90), Cell(m.p99),
-                        Cell(m.p999), Cell(m.max), Cell(s.ratio, "%.2fx"), s.verdict});
+                        Cell(m.p999), Cell(m.max), Cell(s.ratio, "%.2fx"), Cell(s.stall.p99), Cell(s.stall.max),
+                        s.verdict});
     }
-    std::vector<std::size_t> width(std::size(heads), 0);
+    std::string out = "Lateness in microseconds (actual wake-up minus intended time)\n" + FormatColumns(rows);
+    // Under the table: how the stall columns were measured.
+    const NoiseResult& n = r.noise;
+    if (n.mode == "off") return out;
+    char where[96];
+    if (n.mode == "windows") {
+        std::snprintf(where, sizeof where, "in each %.0f us window after a sample, on the survey's CPU", n.windowUs);
+    } else {
+        std::snprintf(where, sizeof where, "during each sample, on spare CPU %d", n.cpu);
+    }
+    char buf[400];
+    std::snprintf(buf, sizeof buf,
+                  "stall: the machine's longest stall %s, seen by a thread spinning at the survey's priority;\n"
+                  "       %zu gaps over %.0f us in %.1f s of spinning, %.3f %% of its time%s\n",
+                  where, n.stalls, n.thresholdUs, n.measuredS,
+                  n.measuredS > 0 ? 100.0 * n.stalledUs / (n.measuredS * 1e6) : 0.0,
+                  n.libraryUs > 0 ? " (the library's timer thread's share left out)" : "");
+    return out + buf;
+}
+
+std::string FormatColumns(const std::vector<std::vector<std::string>>& rows) {
+    std::vector<std::size_t> width;
     for (const auto& row : rows) {
+        width.resize(std::max(width.size(), row.size()), 0);
         for (std::size_t c = 0; c < row.size(); ++c) width[c] = std::max(width[c], row[c].size());
     }
-    std::string out = "Lateness in microseconds (actual wake-up minus intended time)\n";
+    std::string out;
     for (std::size_t i = 0; i < rows.size(); ++i) {
         std::string line;
         for (std::size_t c = 0; c < rows[i].size(); ++c) {
             const bool last = c + 1 == rows[i].size();
             line += last ? rows[i][c] : Pad(rows[i][c], width[c], c > 0) + "  ";
         }
+        line.erase(line.find_last_not_of(' ') + 1);
         out += line + "\n";
         if (i == 0) {
             std::size_t total = 0;

@@ -15,6 +15,11 @@ std::string Format(const char* fmt, double a, double b = 0.0) {
     std::snprintf(buf, sizeof buf, fmt, a, b);
     return buf;
 }
+bool AsGoodAsTheMachine(const Summary& series, const Summary& baseline) {
+    const double ratio = RatioP99(series, baseline);
+    return series.p99 - baseline.p99 <= kVerdictSlackUs || (!std::isnan(ratio) && ratio <= 1.1);
+}
+
 }  // namespace
 
 Summary::Summary() : min(kNaN), mean(kNaN), p50(kNaN), p90(kNaN), p99(kNaN), p999(kNaN), max(kNaN) {}
@@ -62,7 +67,7 @@ std::string VerdictFor(const Summary& series, const Summary& baseline, bool isBa
     } else {
         const double excess = series.p99 - baseline.p99;
         const double ratio = RatioP99(series, baseline);
-        if (excess <= kVerdictSlackUs || (!std::isnan(ratio) && ratio <= 1.1)) {
+        if (AsGoodAsTheMachine(series, baseline)) {
             v = "as good as the machine";
         } else if (!std::isnan(ratio) && ratio <= 1.5) {
             v = "within 1.5x of the machine";
@@ -86,6 +91,17 @@ std::string VerdictFor(const Summary& series, const Summary& baseline, bool isBa
         v += Format("; %.0f calls failed", static_cast<double>(failedCalls));
     }
     return v;
+}
+
+std::string StallClause(const Summary& series, const Summary& baseline, const Summary& stall, bool isBaseline,
+                        int& explained) {
+    explained = -1;
+    if (series.count == 0 || series.early > 0 || stall.count == 0 || baseline.count == 0) return "";
+    if (!isBaseline && AsGoodAsTheMachine(series, baseline)) return "";
+    const double beyond = series.p99 - (baseline.p50 + stall.p99);
+    explained = beyond <= kVerdictSlackUs ? 1 : 0;
+    return explained ? Format("; machine stalls explain the tail (stall p99 %.1f us around it)", stall.p99)
+                     : Format("; tail %.1f us beyond machine stalls (stall p99 %.1f us around it)", beyond, stall.p99);
 }
 
 }  // namespace qtools

@@ -51,6 +51,19 @@ constexpr double kVerdictSlackUs = 5.0;
 std::string VerdictFor(const Summary& series, const Summary& baseline, bool isBaseline,
                        std::size_t failedCalls = 0);
 
+// The machine's part in a series' tail, appended to its verdict. `stall`
+// holds the machine's longest stall per measuring window around the series.
+// The machine explains the tail when the series' p99 is within the
+// baseline's typical wake-up (p50) plus the stall that 1 % of those windows
+// reached (the stall p99), give or take the slack: "; machine stalls explain
+// the tail (stall p99 X us around it)"; otherwise "; tail Y us beyond machine
+// stalls (...)". Said of the baseline and of every series not as good as the
+// machine; empty (and `explained` -1) when there is nothing to say. A window
+// is shorter than a wait, so the stall p99 errs low: "explained" is never
+// claimed on thin evidence.
+std::string StallClause(const Summary& series, const Summary& baseline, const Summary& stall, bool isBaseline,
+                        int& explained);
+
 }  // namespace qtools
 
 #endif

@@ -1,6 +1,8 @@
-// quelta-probe as a user runs it: a short survey with every output, a
-// survey ended by a signal, a run without real-time privilege, the probe
-// outside its build tree, and bad command lines refused before any survey.
+// quelta-probe as a user runs it: the main job as scripts/probe.sh starts it
+// (its defaults, then the user's options, which win), a survey ended by a
+// signal, every documented example, machine stalls, compare, a run without
+// real-time privilege, the probe outside its build tree, and bad command
+// lines refused before any survey.
 #include <gtest/gtest.h>
 #include <fcntl.h>
 #include <linux/capability.h>
@@ -12,11 +14,14 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cmath>
 #include <cstdlib>
+#include <cstring>
 #include <fstream>
 #include <functional>
+#include <iterator>
 #include <map>
 #include <nlohmann/json.hpp>
 #include <sstream>
@@ -47,6 +52,48 @@ std::vector<std::string> Lines(const std::string& text) {
 }
 
 bool Exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
+
+// The files scripts/probe.sh asks for, in build/.
+const char* const kScriptFiles[] = {"probe.json", "probe.svg", "probe-histogram.txt", "probe-samples.csv",
+                                    "probe-trace.json"};
+
+// The probe's arguments as scripts/probe.sh passes them (read from its exec
+// line), with `dir` for its build/ directory and the user's after its own.
+std::vector<std::string> AsTheScriptRunsIt(const std::string& dir, const std::vector<std::string>& user) {
+    const std::string script = ReadFile(std::string(QUELTA_SOURCE_DIR) + "/scripts/probe.sh");
+    std::string line;
+    for (std::size_t at = script.find("\nexec "); at != std::string::npos && line.find("\"$@\"") == std::string::npos;) {
+        const std::size_t end = script.find('\n', at + 1);
+        line += script.substr(at + 1, end - at - 1);
+        at = end;
+    }
+    std::vector<std::string> args;
+    std::istringstream words(line);
+    for (std::string w; words >> w;) {
+        w.erase(std::remove(w.begin(), w.end(), '"'), w.end());
+        if (w == "$@") args.insert(args.end(), user.begin(), user.end());
+        if (w == "exec" || w == "\\" || w == "$@" || w.find("/quelta-probe") != std::string::npos) continue;
+        if (w.rfind("$root/build/", 0) == 0) w = dir + "/" + w.substr(12);
+        args.push_back(w);
+    }
+    EXPECT_TRUE(args.size() > user.size() && std::equal(user.rbegin(), user.rend(), args.rbegin())) << line;
+    return args;
+}
+
+// The documented examples: the lines of `text` from `section` on that are
+// `lead` followed by a quelta-probe command, with the manual's escapes undone.
+std::vector<std::string> Examples(const std::string& text, const std::string& section, const std::string& lead) {
+    std::vector<std::string> out;
+    for (const std::string& l : Lines(text.substr(std::min(text.find(section), text.size())))) {
+        if (l.rfind(lead + "quelta-probe", 0) != 0) continue;
+        std::string cmd = l.substr(lead.size());
+        for (auto [from, to] : {std::pair{"\\-", "-"}, std::pair{"\\(aq", "'"}}) {
+            for (std::size_t p; (p = cmd.find(from)) != std::string::npos;) cmd.replace(p, std::strlen(from), to);
+        }
+        out.push_back(cmd);
+    }
+    return out;
+}
 
 struct ProbeRun {
     int status = -1;  // exit status, or -1 when it did not exit
@@ -148,16 +195,19 @@ std::vector<long> HistogramCounts(const std::string& text, int maxUs) {
     return total;
 }
 
-// A two-second survey on one CPU with every output; the JSON to standard
-// output, the tables to standard error. Every file agrees with the JSON.
+// The main job with the user's options after the script's: a two-second
+// survey on one CPU with every output elsewhere, the JSON to standard
+// output, the tables to standard error. Every file agrees with the JSON; the
+// machine's stalls are measured beside every series.
 TEST_F(ProbeCli, SurveyWritesEveryOutput) {
     const bool realtime = testsupport::CanUseRealtime();
     const int cpu = static_cast<int>(sysconf(_SC_NPROCESSORS_ONLN)) - 1;
     const std::string svg = dir_ + "/p.svg", trace = dir_ + "/t.json", csv = dir_ + "/s.csv", hist = dir_ + "/h.txt";
-    const ProbeRun r = Run({"--duration", "2", "--json", "-", "--svg", svg, "--trace", trace, "--csv", csv,
-                            "--histogram", hist, "--histogram-max", "2000", "--cpu", std::to_string(cpu),
-                            "--priority", "50"});
+    const ProbeRun r = Run(AsTheScriptRunsIt(dir_, {"--duration", "2", "--json", "-", "--svg", svg, "--trace", trace,
+                                                    "--csv", csv, "--histogram", hist, "--histogram-max", "2000",
+                                                    "--cpu", std::to_string(cpu), "--priority", "50"}));
     ASSERT_EQ(r.status, 0) << r.out << r.err;
+    for (const char* f : kScriptFiles) EXPECT_FALSE(Exists(dir_ + "/" + f)) << f;  // every one overridden
     ASSERT_TRUE(json::accept(r.out)) << r.out;  // nothing but the JSON on standard output
     const json doc = json::parse(r.out);
     for (const char* text : {"baseline", "p99/base", "files:", svg.c_str(), trace.c_str(), csv.c_str(), hist.c_str(),
@@ -167,6 +217,9 @@ TEST_F(ProbeCli, SurveyWritesEveryOutput) {
     EXPECT_EQ(r.err.find('\r'), std::string::npos);  // no progress line without a terminal
     EXPECT_EQ(doc["library"], std::string(QUELTA_BINARY_DIR) + "/libquelta.so.6");  // the one built here
     EXPECT_GE(doc["duration_s"].get<double>(), 2.0);
+    EXPECT_LT(doc["duration_s"].get<double>(), 9.0);
+    EXPECT_NE(doc["machine_noise"]["mode"], "off");
+    EXPECT_GT(doc["machine_noise"]["measured_s"].get<double>(), 0.0);
     EXPECT_EQ(doc["survey_cpus"], json({cpu}));
     EXPECT_EQ(doc["machine"]["priority"], realtime ? 50 : 0);
     ASSERT_EQ(doc["series"].size(), 7u);
@@ -180,6 +233,7 @@ TEST_F(ProbeCli, SurveyWritesEveryOutput) {
         EXPECT_TRUE(s["measured"].get<bool>()) << kSeries[i];
         EXPECT_GT(s["count"].get<long>(), 10) << kSeries[i];
         EXPECT_EQ(s["failed"], 0) << kSeries[i];
+        EXPECT_GT(s["machine_stall_count"].get<long>(), 10) << kSeries[i];
     }
     EXPECT_GE(doc["costs"].size(), 7u);
 
@@ -225,25 +279,28 @@ TEST_F(ProbeCli, SurveyWritesEveryOutput) {
     EXPECT_EQ(curves, realtime ? 7 : 2);
 }
 
-// SIGINT or SIGTERM during a survey that would run until interrupted: it
-// stops, prints the tables and writes every file for what was measured.
+// The README's long runs of the main job, ended by SIGINT or SIGTERM: the
+// survey stops, the tables are printed and every file is written for what
+// was measured.
 TEST_F(ProbeCli, SignalEndsASurveyWithTheFilesWritten) {
-    for (int sig : {SIGINT, SIGTERM}) {
+    const std::string cpu = std::to_string(sysconf(_SC_NPROCESSORS_ONLN) - 1);
+    const std::pair<int, std::vector<std::string>> forms[] = {
+        {SIGINT, {"--duration", "12h", "--cpu", cpu, "--interval", "1"}},
+        {SIGTERM, {"--duration", "0", "--interval", "1"}}};
+    for (const auto& [sig, user] : forms) {
         SCOPED_TRACE(strsignal(sig));
-        const std::string js = dir_ + "/p.json", csv = dir_ + "/s.csv", hist = dir_ + "/h.txt", svg = dir_ + "/p.svg",
-                          trace = dir_ + "/t.json";
+        const std::string js = dir_ + "/probe.json", csv = dir_ + "/probe-samples.csv",
+                          hist = dir_ + "/probe-histogram.txt", svg = dir_ + "/probe.svg",
+                          trace = dir_ + "/probe-trace.json";
         for (const std::string& f : {js, csv, hist, svg, trace}) unlink(f.c_str());
         const auto start = std::chrono::steady_clock::now();
-        const ProbeRun r = Run({"--duration", "0", "--interval", "1", "--json", js, "--csv", csv, "--histogram", hist,
-                                "--svg", svg, "--trace", trace},
-                               {}, [&](pid_t pid) {
-                                   // Until the first summary line is out (or 30 s).
-                                   for (int i = 0; i < 300 && ReadFile(dir_ + "/stdout").find("wakes,") ==
-                                                                   std::string::npos; ++i) {
-                                       std::this_thread::sleep_for(std::chrono::milliseconds(100));
-                                   }
-                                   kill(pid, sig);
-                               });
+        const ProbeRun r = Run(AsTheScriptRunsIt(dir_, user), {}, [&](pid_t pid) {
+            // Until the first summary line is out (or 30 s).
+            for (int i = 0; i < 300 && ReadFile(dir_ + "/stdout").find("wakes,") == std::string::npos; ++i) {
+                std::this_thread::sleep_for(std::chrono::milliseconds(100));
+            }
+            kill(pid, sig);
+        });
         ASSERT_EQ(r.status, 0) << r.out << r.err;
         EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(60));
         EXPECT_NE(r.out.find("stopping the survey"), std::string::npos) << r.out;
@@ -264,6 +321,110 @@ TEST_F(ProbeCli, SignalEndsASurveyWithTheFilesWritten) {
         EXPECT_EQ(histTotal, total);
         EXPECT_NE(ReadFile(svg).find("curve-baseline"), std::string::npos);
         EXPECT_TRUE(json::accept(ReadFile(trace)));
+    }
+}
+
+// Every example of --help and of the manual page (the same ones) runs as
+// written, in an empty directory; a survey is shortened by a --duration 1
+// after the example's own options, which wins.
+TEST_F(ProbeCli, EveryDocumentedExampleRuns) {
+    const std::vector<std::string> help = Examples(Run({"--help"}).out, "\nEXAMPLES\n", "    ");
+    const std::vector<std::string> page =
+        Examples(ReadFile(std::string(QUELTA_SOURCE_DIR) + "/docs/quelta-probe.1"), ".SH EXAMPLES", ".B ");
+    EXPECT_EQ(help, page);
+    ASSERT_GE(help.size(), 5u);
+    for (std::string cmd : help) {
+        const std::size_t compare = cmd.find(" compare "), pipe = cmd.find(" | ");
+        if (compare == std::string::npos) {
+            cmd.insert(std::min(pipe, cmd.size()), " --duration 1");
+        } else {  // the two surveys it compares: the one an earlier example saved
+            std::istringstream files(cmd.substr(compare + 9));
+            for (std::string f; files >> f;) {
+                EXPECT_EQ(std::system(("cd '" + dir_ + "' && cp -n probe.json '" + f + "'").c_str()), 0) << f;
+            }
+        }
+        const int status = std::system(("cd '" + dir_ + "' && PATH='" + QUELTA_BINARY_DIR + "/tools':\"$PATH\" && (" +
+                                        cmd + ") >out.txt 2>&1").c_str());
+        EXPECT_EQ(status, 0) << cmd << "\n" << ReadFile(dir_ + "/out.txt");
+    }
+}
+
+// A stall the test makes itself: the whole probe stopped for 60 ms, six
+// times (longer than this VM's own stalls of one CPU, up to some 20 ms). The
+// thread spinning on a spare CPU sees each stop as a stall that long and
+// charges it to the sample it delayed: only series with a sample that late
+// are charged one.
+TEST_F(ProbeCli, AStoppedMachineShowsAsStalls) {
+    const long cpus = sysconf(_SC_NPROCESSORS_ONLN);
+    if (cpus < 2 || !testsupport::CanUseRealtime()) GTEST_SKIP() << "needs two CPUs and SCHED_FIFO";
+    const ProbeRun r = Run({"--duration", "4", "--cpu", std::to_string(cpus - 1), "--noise", "0", "--json", "-"}, {},
+                           [&](pid_t pid) {
+                               for (int i = 0; i < 300 && ReadFile(dir_ + "/stderr").empty(); ++i) {
+                                   std::this_thread::sleep_for(std::chrono::milliseconds(100));
+                               }
+                               std::this_thread::sleep_for(std::chrono::milliseconds(1000));  // surveying
+                               for (int i = 0; i < 6; ++i) {
+                                   kill(pid, SIGSTOP);
+                                   std::this_thread::sleep_for(std::chrono::milliseconds(60));
+                                   kill(pid, SIGCONT);
+                                   std::this_thread::sleep_for(std::chrono::milliseconds(50));
+                               }
+                           });
+    ASSERT_EQ(r.status, 0) << r.err;
+    const json doc = json::parse(r.out);
+    EXPECT_EQ(doc["machine_noise"]["mode"], "spare-cpu");
+    EXPECT_EQ(doc["machine_noise"]["cpu"], 0);
+    EXPECT_GE(doc["machine_noise"]["stall_max"].get<double>(), 50000.0) << doc["machine_noise"].dump();
+    int charged = 0;
+    for (const json& s : doc["series"]) {
+        if (s["name"] == "tick" || s["machine_stall_max"].get<double>() < 50000.0) continue;
+        ++charged;
+        EXPECT_GE(s["max"].get<double>(), 40000.0) << s.dump();
+    }
+    EXPECT_GE(charged, 1) << r.out;
+}
+
+// Two saved surveys side by side: p50, p99 and max of each series with B/A,
+// and the machines' stalls; a file that is missing, not JSON or of another
+// schema is refused.
+TEST_F(ProbeCli, CompareShowsTwoSurveysSideBySide) {
+    auto survey = [this](const char* file, const char* schema, const std::string& series, const char* noise) {
+        std::ofstream(dir_ + "/" + file) << "{\"schema\": \"" << schema << "\", \"machine\": {\"cpus\": 2}, "
+                                         << noise << "\"series\": [" << series << "]}";
+        return dir_ + "/" + file;
+    };
+    const std::string a = survey("a.json", "quelta-probe/1",
+                                 R"({"name": "baseline", "p50": 10, "p99": 20, "max": 40},
+                                    {"name": "tick", "p50": 5, "p99": null, "max": 9})", "");
+    const std::string b = survey("b.json", "quelta-probe/1",
+                                 R"({"name": "baseline", "p50": 12, "p99": 30, "max": 20},
+                                    {"name": "global-wait", "p50": 1, "p99": 2, "max": 3})",
+                                 R"("machine_noise": {"mode": "windows", "stall_p99": 35, "stall_max": 2100},)");
+    const std::string other = survey("other.json", "quelta-probe/2", "", "");
+    std::ofstream(dir_ + "/bad.json") << "{\"schema\": ";
+    const ProbeRun r = Run({"compare", a, b});
+    ASSERT_EQ(r.status, 0) << r.err;
+    std::vector<std::vector<std::string>> rows;
+    for (const std::string& l : Lines(r.out)) {
+        std::istringstream in(l);
+        rows.emplace_back(std::istream_iterator<std::string>(in), std::istream_iterator<std::string>());
+    }
+    const std::vector<std::vector<std::string>> want = {
+        {"baseline", "10.0", "12.0", "1.20x", "20.0", "30.0", "1.50x", "40.0", "20.0", "0.50x"},
+        {"tick", "5.0", "-", "-", "-", "-", "-", "9.0", "-", "-", "only", "in", "A"},
+        {"global-wait", "-", "1.0", "-", "-", "2.0", "-", "-", "3.0", "-", "only", "in", "B"}};
+    for (const auto& row : want) EXPECT_NE(std::find(rows.begin(), rows.end(), row), rows.end()) << row[0] << r.out;
+    EXPECT_NE(r.out.find("(us): A not measured, B 35.0 / 2100.0"), std::string::npos) << r.out;
+
+    const std::pair<std::vector<std::string>, const char*> errors[] = {
+        {{"compare", a}, "needs two files"},
+        {{"compare", a, dir_ + "/missing.json"}, "missing.json: No such file"},
+        {{"compare", dir_ + "/bad.json", b}, "bad.json: not a JSON document"},
+        {{"compare", a, other}, "other.json: schema 'quelta-probe/2', but this quelta-probe reads 'quelta-probe/1'"}};
+    for (const auto& [args, message] : errors) {
+        const ProbeRun e = Run(args);
+        EXPECT_EQ(e.status, 1) << message;
+        EXPECT_NE(e.err.find(message), std::string::npos) << e.err;
     }
 }
 
@@ -349,6 +510,8 @@ TEST_F(ProbeCli, ErrorsExitWithTheirStatusBeforeAnySurvey) {
         {{"--priority", "99"}, 1, "--priority"},
         {{"--priority", "5", "--no-realtime"}, 1, "contradict"},
         {{"--histogram-max", "10001"}, 1, "--histogram-max"},
+        {{"--noise", "0"}, 1, "needs --cpu"},
+        {{"--noise", "spare"}, 1, "--noise"},
         {{"--json", "-", "--csv", "-"}, 1, "only one output"},
         {{"--library", dir_ + "/missing/libquelta.so.6", "--json", left}, 2, "No such file"},
         {{"--library", notLib}, 2, "cannot load library"},
@@ -377,7 +540,8 @@ TEST_F(ProbeCli, ManualPageAndHelpNameEveryOption) {
     const std::pair<const char*, const char*> options[] = {
         {"--duration", "5"}, {"--interval", "5"}, {"--cpu", "0"}, {"--priority", "5"}, {"--no-realtime", nullptr},
         {"--library", "x"},  {"--json", "x"},     {"--svg", "x"}, {"--trace", "x"},    {"--csv", "x"},
-        {"--histogram", "x"}, {"--histogram-max", "5"}, {"--help", nullptr}, {"--version", nullptr}};
+        {"--histogram", "x"}, {"--histogram-max", "5"}, {"--noise", "off"}, {"--help", nullptr},
+        {"--version", nullptr}};
     for (const auto& [name, value] : options) {
         EXPECT_NE(help.find(name), std::string::npos) << name;
         std::string roff;

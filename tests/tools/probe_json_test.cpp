@@ -32,6 +32,13 @@ qtools::ProbeReport SampleReport() {
     const qtools::SeriesResult base = series("baseline", {10, 20, 30, 40}, 0, 0);
     qtools::SeriesResult wait = series("plain-wait", {15, 25, 35, 55, 1500, 2500.1234}, 0, 1);
     wait.overMs = 2;
+    wait.stall = qtools::Summarize(std::vector<double>{3, 2600});
+    r.noise.mode = "windows";
+    r.noise.thresholdUs = 5;
+    r.noise.windowUs = 200;
+    r.noise.measuredS = 2;
+    r.noise.stalledUs = 1000;
+    r.noise.longest = wait.stall;
     const qtools::SeriesResult empty = series("event-own-sem", {}, 7, -1);
     qtools::SeriesResult off = series("tick", {}, 0, -1);
     off.measured = false;
@@ -53,7 +60,9 @@ TEST(ProbeJson, ReportFollowsTheSchema) {
     ASSERT_EQ(costs.size(), 2u);
     for (const json& s : series) {
         for (const char* key : {"name", "measured", "unit", "count", "min", "mean", "p50", "p90", "p99", "p999",
-                                "max", "ratio_p99_to_baseline", "verdict", "early", "failed", "over_1ms"}) {
+                                "max", "ratio_p99_to_baseline", "verdict", "early", "failed", "over_1ms",
+                                "machine_stall_count", "machine_stall_p99", "machine_stall_max",
+                                "machine_stalls_explain_tail"}) {
             EXPECT_TRUE(s.contains(key)) << key;
         }
         EXPECT_EQ(s["unit"], "us");
@@ -75,6 +84,14 @@ TEST(ProbeJson, ReportFollowsTheSchema) {
     EXPECT_DOUBLE_EQ(series[0]["ratio_p99_to_baseline"].get<double>(), 1.0);
     EXPECT_EQ(series[1]["over_1ms"], 2);
     EXPECT_EQ(series[1]["over_1ms_cpu_held"], 1);
+    EXPECT_DOUBLE_EQ(series[1]["machine_stall_p99"].get<double>(), 2600);
+    EXPECT_EQ(series[1]["machine_stalls_explain_tail"], true);
+    EXPECT_NE(series[1]["verdict"].get<std::string>().find("machine stalls explain the tail"), std::string::npos);
+    EXPECT_TRUE(series[0]["machine_stall_p99"].is_null() && series[0]["machine_stalls_explain_tail"].is_null());
+    EXPECT_EQ(v["machine_noise"]["mode"], "windows");
+    EXPECT_DOUBLE_EQ(v["machine_noise"]["stalled_fraction"].get<double>(), 0.0005);
+    EXPECT_DOUBLE_EQ(v["machine_noise"]["stall_max"].get<double>(), 2600);
+    EXPECT_TRUE(v["machine_noise"]["cpu"].is_null() && v["machine_noise"]["library_timer_us"].is_null());
     EXPECT_EQ(series[2]["count"], 0);
     EXPECT_TRUE(series[2]["p99"].is_null() && series[2]["ratio_p99_to_baseline"].is_null());
     EXPECT_TRUE(series[2]["over_1ms_cpu_held"].is_null());
@@ -95,6 +112,8 @@ TEST(ProbeJson, TablesShowEverySeriesWithOneDecimal) {
     for (const char* name : {"baseline", "plain-wait", "event-own-sem"}) EXPECT_NE(t.find(name), std::string::npos);
     EXPECT_NE(t.find("2500.1"), std::string::npos);
     EXPECT_NE(t.find("62.50x"), std::string::npos);
+    EXPECT_NE(t.find("stall max"), std::string::npos);
+    EXPECT_NE(t.find("in each 200 us window after a sample"), std::string::npos);
     EXPECT_NE(t.find("no samples; 7 calls failed"), std::string::npos);
     EXPECT_NE(t.find("not measured: needs the library's timer"), std::string::npos);
     EXPECT_NE(c.find("22.3"), std::string::npos);

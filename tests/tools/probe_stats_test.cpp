@@ -123,6 +123,30 @@ TEST(ProbeStats, VerdictComparesP99WithTheBaseline) {
     EXPECT_EQ(VerdictFor(base, base, false, 3), "as good as the machine; 3 calls failed");
 }
 
+// The machine explains a tail that stays within the baseline's typical
+// wake-up plus the stall p99 around the series; said of the baseline and of
+// series not as good as the machine, never without stall figures.
+TEST(ProbeStats, StallsExplainATailOrNot) {
+    const Summary base = WithP99(100, 50), none = Summarize(std::vector<double>{});
+    const struct {
+        Summary series, stall;
+        bool isBaseline;
+        int explained;
+        const char* clause;
+    } cases[] = {
+        {WithP99(140), WithP99(90), false, 1, "; machine stalls explain the tail (stall p99 90.0 us around it)"},
+        {WithP99(300), WithP99(100), false, 0, "; tail 150.0 us beyond machine stalls (stall p99 100.0 us around it)"},
+        {base, WithP99(20), true, 0, "; tail 30.0 us beyond machine stalls (stall p99 20.0 us around it)"},
+        {WithP99(105), WithP99(900), false, -1, ""},  // as good as the machine: nothing to explain
+        {WithP99(300), none, false, -1, ""},
+    };
+    for (const auto& c : cases) {
+        int explained = 7;
+        EXPECT_EQ(qtools::StallClause(c.series, base, c.stall, c.isBaseline, explained), c.clause);
+        EXPECT_EQ(explained, c.explained) << c.clause;
+    }
+}
+
 // Tick times following the library's rule: each tick one period after the
 // last, unless served more than a period late, when the grid restarts then.
 struct TickRun {

@@ -18,6 +18,7 @@
 #include "ProbeReport.h"
 #include "SvgPlot.h"
 #include "TraceExport.h"
+#include "probe/Compare.h"
 #include "probe/LoadedQuelta.h"
 #include "probe/Monitor.h"
 #include "probe/Outputs.h"
@@ -76,6 +77,21 @@ std::vector<int> OnlineCpus() {
     return cpus;
 }
 
+// A CPU for the machine-noise thread when the survey leaves one: with
+// --cpu, on a machine of three CPUs or more (one is left for everything
+// else), the highest online CPU this process may use outside the survey's;
+// -1 when there is none.
+int SpareCpu(const std::vector<int>& online, const std::vector<int>& surveyCpus) {
+    if (surveyCpus.empty() || online.size() < 3) return -1;
+    cpu_set_t allowed;
+    CPU_ZERO(&allowed);
+    if (sched_getaffinity(0, sizeof allowed, &allowed) != 0) return -1;
+    for (auto c = online.rbegin(); c != online.rend(); ++c) {
+        if (CPU_ISSET(*c, &allowed) && !std::binary_search(surveyCpus.begin(), surveyCpus.end(), *c)) return *c;
+    }
+    return -1;
+}
+
 qtools::ProbeReport MakeReport(SurveyResult& survey, const std::string& library, const ProbeOptions& options) {
     qtools::ProbeReport report;
     report.machine = Machine(survey);
@@ -95,8 +111,24 @@ qtools::ProbeReport MakeReport(SurveyResult& survey, const std::string& library,
         r.failed = s.failed;
         r.overMs = s.overMs;
         r.cpuHeld = s.cpuHeld;
+        // The tick runs throughout, so every window is around it.
+        const NoiseFigures& noise = survey.noise;
+        if (noise.mode != NoiseMode::Off) {
+            r.stall = qtools::Summarize(s.id == kTick ? noise.all : noise.perSeries[s.id]);
+        }
         report.series.push_back(r);
     }
+    const NoiseFigures& n = survey.noise;
+    qtools::NoiseResult& nr = report.noise;
+    nr.mode = n.mode == NoiseMode::Off ? "off" : n.mode == NoiseMode::Windows ? "windows" : "spare-cpu";
+    nr.cpu = n.cpu;
+    nr.thresholdUs = static_cast<double>(kStallThresholdNs) / 1000.0;
+    nr.windowUs = static_cast<double>(kNoiseWindowNs) / 1000.0;
+    nr.measuredS = static_cast<double>(n.spunNs) / 1e9;
+    nr.stalls = static_cast<std::size_t>(n.stalls);
+    nr.stalledUs = static_cast<double>(n.stalledNs) / 1000.0;
+    nr.libraryUs = n.libraryNs >= 0 ? static_cast<double>(n.libraryNs) / 1000.0 : -1.0;
+    nr.longest = qtools::Summarize(n.all);
     report.costs = survey.costs;
     report.notes = survey.notes;
     qtools::FinishVerdicts(report);
@@ -133,6 +165,8 @@ void PrintTables(FILE* out, const qtools::ProbeReport& report, const SurveyResul
 }  // namespace
 
 int main(int argc, char** argv) {
+    if (argc >= 2 && std::strcmp(argv[1], "compare") == 0) return RunCompare(argc - 2, argv + 2, stdout, stderr);
+
     // SIGINT and SIGTERM end the survey cleanly. They are blocked before any
     // thread exists (the library's timer thread included), so only this
     // thread takes them, through sigtimedwait in its loop.
@@ -158,14 +192,15 @@ int main(int argc, char** argv) {
         case ParseOutcome::Run:
             break;
     }
-    if (!options.cpus.empty()) {
-        const std::vector<int> online = OnlineCpus();
-        for (int c : options.cpus) {
-            if (!online.empty() && !std::binary_search(online.begin(), online.end(), c)) {
-                std::fprintf(stderr, "quelta-probe: --cpu: CPU %d is not online\n"
-                                     "Try 'quelta-probe --help' for more information.\n", c);
-                return kExitUsage;
-            }
+    const std::vector<int> online = OnlineCpus();
+    std::vector<std::pair<const char*, int>> chosen;
+    for (int c : options.cpus) chosen.emplace_back("--cpu", c);
+    if (options.noise == NoiseChoice::Cpu) chosen.emplace_back("--noise", options.noiseCpu);
+    for (const auto& [flag, c] : chosen) {
+        if (!online.empty() && !std::binary_search(online.begin(), online.end(), c)) {
+            std::fprintf(stderr, "quelta-probe: %s: CPU %d is not online\n"
+                                 "Try 'quelta-probe --help' for more information.\n", flag, c);
+            return kExitUsage;
         }
     }
 
@@ -212,6 +247,13 @@ int main(int argc, char** argv) {
     config.realtime = options.realtime;
     config.priority = options.priority;
     config.cpus = options.cpus;
+    const int spare = options.noise == NoiseChoice::Cpu    ? options.noiseCpu
+                      : options.noise == NoiseChoice::Auto ? SpareCpu(online, options.cpus)
+                                                           : -1;
+    config.noise = options.noise == NoiseChoice::Off ? NoiseMode::Off
+                   : spare >= 0                      ? NoiseMode::SpareCpu
+                                                     : NoiseMode::Windows;
+    config.noiseCpu = spare;
     Survey survey(lib, config);
     Monitor monitor(csv.requested() ? csv.stream() : nullptr);
     if (!survey.Start()) {

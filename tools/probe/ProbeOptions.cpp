@@ -70,8 +70,12 @@ bool ParseCpuList(const std::string& text, std::vector<int>& cpus) {
 ParseOutcome ParseOptions(int argc, char** argv, ProbeOptions& o, std::string& error) {
     CLI::App app{"quelta-probe"};
     app.set_help_flag();  // the manual text instead of the library's help
+    // A later option overrides an earlier one, so that a user's options win
+    // over the defaults a script passes first (scripts/probe.sh). Flags
+    // already behave so.
+    app.option_defaults()->multi_option_policy(CLI::MultiOptionPolicy::TakeLast);
     bool help = false, version = false, noRealtime = false;
-    std::string duration, cpuList;
+    std::string duration, cpuList, noise = "auto";
     int interval = -1, priority = 0, histogramMax = kDefaultHistogramMaxUs;
     const int maxPriority = sched_get_priority_max(SCHED_FIFO) - 1;
     app.add_flag("-h,--help", help);
@@ -79,17 +83,19 @@ ParseOutcome ParseOptions(int argc, char** argv, ProbeOptions& o, std::string& e
     app.add_option("-d,--duration", duration);
     app.add_option("-l,--library", o.library)->check(CLI::Validator(
         [](std::string& s) { return s.empty() ? std::string("needs a path") : std::string(); }, "PATH"));
+    // An empty FILE turns the output off: how a user drops one that a
+    // script's defaults ask for (the CSV grows by 130 MB an hour).
     for (auto [flag, target] : {std::pair{"--json", &o.jsonPath}, std::pair{"--svg", &o.svgPath},
                                 std::pair{"--trace", &o.tracePath}, std::pair{"--csv", &o.csvPath},
                                 std::pair{"--histogram", &o.histogramPath}}) {
-        app.add_option(flag, *target)->check(CLI::Validator(
-            [](std::string& s) { return s.empty() ? std::string("needs a file name") : std::string(); }, "FILE"));
+        app.add_option(flag, *target);
     }
     app.add_option("--histogram-max", histogramMax)->check(CLI::Range(1, 10000));
     app.add_option("-i,--interval", interval)->check(CLI::Range(0, 86400));
     app.add_option("--cpu", cpuList);
     app.add_option("-p,--priority", priority)->check(CLI::Range(1, std::max(1, maxPriority)));
     app.add_flag("--no-realtime", noRealtime);
+    app.add_option("--noise", noise);
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {
@@ -110,6 +116,20 @@ ParseOutcome ParseOptions(int argc, char** argv, ProbeOptions& o, std::string& e
     }
     if (!cpuList.empty() && !ParseCpuList(cpuList, o.cpus)) {
         error = "--cpu: '" + cpuList + "' is not a CPU list such as 1 or 2-3 or 0,2";
+        return ParseOutcome::Error;
+    }
+    int64_t noiseCpu = -1;
+    if (noise == "auto" || noise == "windows" || noise == "off") {
+        o.noise = noise == "auto" ? NoiseChoice::Auto : noise == "windows" ? NoiseChoice::Windows : NoiseChoice::Off;
+    } else if (ParseWhole(noise, noiseCpu) && noiseCpu < CPU_SETSIZE) {
+        o.noise = NoiseChoice::Cpu;
+        o.noiseCpu = static_cast<int>(noiseCpu);
+        if (o.cpus.empty() || std::binary_search(o.cpus.begin(), o.cpus.end(), o.noiseCpu)) {
+            error = "--noise " + noise + ": a CPU of its own needs --cpu with a list of other CPUs for the survey";
+            return ParseOutcome::Error;
+        }
+    } else {
+        error = "--noise: '" + noise + "' is not auto, windows, off or a CPU number";
         return ParseOutcome::Error;
     }
     if (priority != 0 && noRealtime) {
@@ -137,8 +157,10 @@ const char* ManualText() {
 
 SYNOPSIS
     quelta-probe [-d TIME] [-l PATH] [--cpu LIST] [-p N] [--no-realtime]
-                 [-i S] [--json FILE] [--svg FILE] [--trace FILE]
-                 [--csv FILE] [--histogram FILE] [--histogram-max US]
+                 [--noise WHERE] [-i S] [--json FILE] [--svg FILE]
+                 [--trace FILE] [--csv FILE] [--histogram FILE]
+                 [--histogram-max US]
+    quelta-probe compare A.json B.json
     quelta-probe --help | --version
 
 DESCRIPTION
@@ -175,6 +197,13 @@ DESCRIPTION
     documented; the probe then says so, shows them as not measured, surveys
     the baseline and plain-wait alone and exits 0.
 
+    Beside the series it measures the machine's own stalls: a thread at the
+    survey's priority spins reading CLOCK_MONOTONIC, and every gap is time
+    the CPU was taken from it (an interrupt, an SMI, the hypervisor, a task
+    of higher priority; the library's timer thread is left out). Each series
+    gets the p99 and max of the longest stall around its samples, and its
+    verdict says whether those stalls explain its tail.
+
     After a survey that ran its full duration it measures what calls cost,
     in ns per call (median of batches): the engine's clock reads next to
     clock_gettime, a conversion between the time bases, the log engine's
@@ -201,6 +230,14 @@ OPTIONS
            just below the library's timer thread.
     --no-realtime
            Do not ask for SCHED_FIFO even when it is allowed.
+    --noise WHERE
+           Where the machine's stalls are measured: auto (default), windows,
+           a CPU number, or off. windows: the survey thread spins for 200 us
+           after each sample, on its own CPU. A CPU number: a thread of its
+           own spins on that CPU throughout (outside the --cpu list, which
+           it needs; real-time only) and watches each sample. auto takes the
+           highest spare CPU when --cpu leaves one on a machine of 3 CPUs or
+           more, windows otherwise.
     -l, --library PATH
            Load this libquelta.so.6 instead of the one the dynamic loader
            finds (a probe in a build tree finds the library built beside it).
@@ -231,22 +268,38 @@ OPTIONS
            Show the probe's version.
 
     FILE may be - for standard output (one output at most); the tables then
-    go to standard error. Every output is opened before the survey starts,
-    and where each went is printed at the end.
+    go to standard error. An empty FILE ('') turns that output off. Every
+    output is opened before the survey starts, and where each went is
+    printed at the end.
+
+    An option given again overrides the earlier one: the user's options
+    after a script's defaults win (bash scripts/probe.sh --duration 60).
+
+COMPARE
+    quelta-probe compare A.json B.json shows two surveys saved with --json
+    side by side: per series p50, p99 and max of A and of B with the ratio
+    B/A (below 1: better in B), and each survey's machine stalls. It reads
+    schema "quelta-probe/1" and refuses a file that is missing, not JSON or
+    of another schema (exit status 1).
 
 OUTPUT
     A table with one row per series: sample count, min, p50, p90, p99, p99.9
     and max of the lateness in microseconds, the ratio of the series' p99 to
-    the baseline's p99, and a verdict: "as good as the machine" (within 1.1x
-    or 5 us), "within 1.5x of the machine", "within 2x of the machine",
-    "worse than the machine: ..." with the factor, or "not measured: ...".
-    Then a table of call costs and notes. While the survey runs, a progress
+    the baseline's p99, the p99 and max of the machine's longest stall
+    around the series' samples, and a verdict: "as good as the machine"
+    (within 1.1x or 5 us), "within 1.5x of the machine", "within 2x of the
+    machine", "worse than the machine: ..." with the factor, or "not
+    measured: ...". For the baseline and every series not as good as the
+    machine the verdict adds "machine stalls explain the tail" (its p99 is
+    within the baseline's p50 plus the stall p99 around it) or "tail N us
+    beyond machine stalls". Then a table of call costs and notes. While the survey runs, a progress
     line is shown when standard output is a terminal.
 
 EXIT STATUS
     0   the survey ran (or was ended by a signal); no wait returned early;
         series that need real-time privilege may be shown as not measured
-    1   usage error: unknown option, missing or bad value
+    1   usage error: unknown option, missing or bad value; for compare, a
+        file that is missing, not JSON or of another schema
     2   the library could not be loaded, lacks a symbol, or did not start
     3   a wait of the library returned before its deadline
     4   an output file could not be opened or written
@@ -256,11 +309,14 @@ EXAMPLES
            Ten seconds, tables on the terminal.
     quelta-probe --duration 60 --json probe.json --svg probe.svg
            A minute, with results for other tools and a plot.
-    quelta-probe -d 0 --cpu 3 --histogram hist.txt --csv samples.csv
-           A qualification run on an isolated CPU until Ctrl-C, with a
-           summary line a minute.
-    quelta-probe --json - | jq '.series[] | {name, p99}'
+    quelta-probe -d 0 --cpu 1 --histogram hist.txt --csv samples.csv
+           A qualification run on CPU 1 (an isolated one, ideally) until
+           Ctrl-C, with a summary line a minute.
+    quelta-probe --json - | jq '.series[] | {name, p99, machine_stall_p99}'
            JSON to a pipe, the tables to the terminal.
+    quelta-probe compare before.json after.json
+           Two surveys saved with --json, before and after a change, side
+           by side.
 )";
 }
 

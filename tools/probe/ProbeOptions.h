@@ -21,6 +21,9 @@ constexpr int64_t kMaxDurationS = 30LL * 24 * 3600;  // 30 days; 0 runs until in
 constexpr int kDefaultIntervalUntilInterrupted = 60;
 constexpr int kDefaultHistogramMaxUs = 10000;
 
+// --noise: where the machine's stalls are measured beside the survey.
+enum class NoiseChoice { Auto, Windows, Cpu, Off };
+
 struct ProbeOptions {
     int64_t durationS = 10;  // 0: until SIGINT or SIGTERM
     int intervalS = -1;      // summary line every N s; 0 none; -1 the default
@@ -34,6 +37,8 @@ struct ProbeOptions {
     std::vector<int> cpus;   // survey thread's CPUs; empty: not restricted
     int priority = 0;        // SCHED_FIFO priority; 0: just below the library's timer thread
     bool realtime = true;
+    NoiseChoice noise = NoiseChoice::Auto;
+    int noiseCpu = -1;       // NoiseChoice::Cpu
 };
 
 enum class ParseOutcome { Run, Help, Version, Error };

@@ -1,6 +1,5 @@
 #include "probe/Survey.h"
 
-#include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <pthread.h>
@@ -14,7 +13,6 @@
 #include <cmath>
 #include <cstdio>
 #include <cstring>
-#include <fstream>
 #include <iterator>
 #include <random>
 
@@ -118,27 +116,14 @@ void OnCallbackTime(void* arg) {
     qtools::RuntimeSemaphorePost(s->semaphore);
 }
 
-// The library's timer thread, found by its name: its scheduling policy and
-// priority, or false when it cannot be seen.
-bool TimerThreadPolicy(int& policy, int& priority) {
-    DIR* d = opendir("/proc/self/task");
-    if (d == nullptr) return false;
-    bool found = false;
-    while (dirent* e = readdir(d)) {
-        if (e->d_name[0] == '.') continue;
-        std::ifstream comm(std::string("/proc/self/task/") + e->d_name + "/comm");
-        std::string name;
-        std::getline(comm, name);
-        if (name != "QUELTAisr") continue;
-        const pid_t tid = static_cast<pid_t>(std::atoi(e->d_name));
-        sched_param p{};
-        policy = sched_getscheduler(tid);
-        found = policy >= 0 && sched_getparam(tid, &p) == 0;
-        priority = p.sched_priority;
-        break;
-    }
-    closedir(d);
-    return found;
+// The library's timer thread's scheduling policy and priority, or false
+// when it cannot be seen.
+bool TimerThreadPolicy(pid_t tid, int& policy, int& priority) {
+    if (tid < 0) return false;
+    sched_param p{};
+    policy = sched_getscheduler(tid);
+    priority = sched_getparam(tid, &p) == 0 ? p.sched_priority : 0;
+    return policy >= 0;
 }
 
 }  // namespace
@@ -157,6 +142,7 @@ struct Worker {
     std::atomic<uint64_t> samples{0};
     SpscRing<RingSample> ring{kRingSize};
     TickFeed ticks;
+    pid_t timerTid = -1;  // set before the worker starts
 
     // The worker's own, read by others only after the join.
     std::vector<SeriesStats> stats = std::vector<SeriesStats>(kSeriesCount);
@@ -389,6 +375,22 @@ void Worker::Run() {
         engine->RegisterTickCallback(&OnTick);
     }
 
+    // The machine's stalls, measured beside the series; on a spare CPU only
+    // by a real-time thread (at normal priority it would measure the
+    // scheduler's sharing, not the machine).
+    MachineNoise noise(kSeriesCount, timerTid);
+    if (config.noise == NoiseMode::SpareCpu && !out.realtime) {
+        out.notes.push_back("machine stalls measured in windows on the survey's CPU: a spare CPU needs real-time "
+                            "scheduling");
+        noise.UseWindows();
+    } else if (config.noise == NoiseMode::SpareCpu && !noise.StartSpare(config.noiseCpu, out.priority)) {
+        out.notes.push_back("machine stalls measured in windows on the survey's CPU: no thread could be started on "
+                            "CPU " + std::to_string(config.noiseCpu));
+        noise.UseWindows();
+    } else if (config.noise == NoiseMode::Windows) {
+        noise.UseWindows();
+    }
+
     const int64_t start = MonoNs();
     const int64_t end = config.durationS == 0 ? INT64_MAX : start + config.durationS * 1000 * kNsPerMs;
     surveyStartNs.store(start, std::memory_order_relaxed);
@@ -399,8 +401,11 @@ void Worker::Run() {
             if (!usable(id) || stop.load(std::memory_order_relaxed)) continue;
             int64_t intended = 0, latenessNs = 0;
             const int64_t delayBefore = RunDelayNs(schedstatFd);
+            noise.Begin(id);
             const bool ok = attempt(id, intended, latenessNs);
+            noise.End();
             const int64_t delayAfter = RunDelayNs(schedstatFd);
+            noise.Window(id);
             if (!ok) continue;
             const double lateness = static_cast<double>(latenessNs) / 1000.0;
             stats[id].histogram.Add(lateness);
@@ -417,6 +422,7 @@ void Worker::Run() {
         }
     }
     const int64_t stopped = MonoNs();
+    out.noise = std::move(noise.Stop());
     surveyEndNs.store(stopped, std::memory_order_relaxed);
     out.surveyedS = static_cast<double>(stopped - start) / 1e9;
     out.interrupted = stop.load(std::memory_order_relaxed);
@@ -594,7 +600,8 @@ bool Survey::Start() {
     SurveyResult& result = result_;
     const SurveyConfig& config = worker_->config;
     int timerPolicy = 0, timerPriority = 0;
-    if (!TimerThreadPolicy(timerPolicy, timerPriority)) {
+    worker_->timerTid = LibraryTimerThread();
+    if (!TimerThreadPolicy(worker_->timerTid, timerPolicy, timerPriority)) {
         timerThreadNote_ = "the library's timer thread QUELTAisr is not running (it needs SCHED_FIFO)";
     } else if (timerPolicy != SCHED_FIFO) {
         timerThreadNote_ = "the library's timer thread QUELTAisr does not run under SCHED_FIFO";

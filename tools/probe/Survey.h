@@ -26,6 +26,7 @@
 #include "ProbeReport.h"
 #include "TraceExport.h"
 #include "probe/LoadedQuelta.h"
+#include "probe/MachineNoise.h"
 
 namespace qprobe {
 
@@ -79,6 +80,8 @@ struct SurveyConfig {
     bool realtime = true;
     int priority = 0;        // 0: just below the library's timer thread
     std::vector<int> cpus;   // empty: not restricted
+    NoiseMode noise = NoiseMode::Windows;  // SpareCpu: on noiseCpu, when real-time
+    int noiseCpu = -1;
 };
 
 struct SurveyResult {
@@ -93,6 +96,7 @@ struct SurveyResult {
     bool timerRunning = true;
     bool interrupted = false;
     double surveyedS = 0.0;
+    NoiseFigures noise;  // the machine's stalls while the survey ran
     std::vector<std::string> notes;
 };
 
