@@ -72,8 +72,7 @@ tick.serial-stuck @@ engine/TickService.cpp @@ sTickSerial.fetch_add(1, kRelaxed
 tick.argument-ignored @@ engine/TickService.cpp @@ fn(arg != nullptr ? arg : const_cast<ClockTime*>(now)); @@ fn(const_cast<ClockTime*>(now));
 # --- wait list (engine/WaitList.cpp) ---
 list.head-due-strict @@ engine/WaitList.cpp @@ if (!Due(effective, now)) {<NL>            if (!whole) break; @@ if (!Earlier(effective, now)) {<NL>            if (!whole) break;
-list.equal-before @@ engine/WaitList.cpp @@ if (Earlier(own, EffectiveDeadline(following, offset))) { @@ if (!Earlier(EffectiveDeadline(following, offset), own)) {
-list.equal-head-before @@ engine/WaitList.cpp @@ } else if (Earlier(own, EffectiveDeadline(head, offset))) { @@ } else if (!Earlier(EffectiveDeadline(head, offset), own)) {
+list.equal-before @@ engine/WaitList.cpp @@ if (Earlier(own, EffectiveDeadline(current, offset))) break; @@ if (!Earlier(EffectiveDeadline(current, offset), own)) break;
 list.new-head-not-armed @@ engine/WaitList.cpp @@ if (NeedsTimer(node, effective) && Earlier(effective, gNextDeadline.Load())) { @@ if (false) {
 list.queued-without-timer @@ engine/WaitList.cpp @@         if (TimerServing()) {<NL>            if (needOffset) NotePlacementOffset(offset); @@         if (true) {<NL>            if (needOffset) NotePlacementOffset(offset);
 list.self-waking-posted @@ engine/WaitList.cpp @@ if (self != 0 && Due(self, now)) node->postOnFire.store(0, kRelaxed); @@ (void)self;
@@ -148,9 +147,9 @@ start.first-tick-at-once @@ engine/LibraryFrame.cpp @@ const uint64_t first = To
 start.first-tick-late @@ engine/LibraryFrame.cpp @@ const uint64_t first = ToU64(now) + gTickPeriod.Load(); @@ const uint64_t first = ToU64(now) + 3 * gTickPeriod.Load();
 start.no-epoch-offset @@ engine/LibraryFrame.cpp @@     engine->SetEpochOffset(ComputeEpochOffset()); @@     (void)0;
 # --- timer (source/os_extensions/nsengine) ---
-timer.wakes-before-start @@ source/os_extensions/nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.cpp @@ if (state.threadId.load() >= 0 && !OnTimerThread()) { @@ if (!OnTimerThread()) {
+timer.wakes-before-start @@ source/os_extensions/nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.cpp @@ return state.threadId.load() >= 0 && !OnTimerThread(); @@ return !OnTimerThread();
 timer.deadline-kept @@ source/os_extensions/nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.cpp @@         state->expiry = TimerTimespec{kParkedSeconds, 0};<NL> @@ <NL>
-timer.fires-when-woken @@ source/os_extensions/nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.cpp @@ if (SleepUntil(*state, snapshot, deadline) == PalSleepResult::kDeadline) { @@ if (SleepUntil(*state, snapshot, deadline) != PalSleepResult::kFailed) {
+timer.fires-when-woken @@ source/os_extensions/nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.cpp @@ if (SleepUntil(*state, snapshot, takenCount, deadline) == PalSleepResult::kDeadline) { @@ if (SleepUntil(*state, snapshot, takenCount, deadline) != PalSleepResult::kFailed) {
 timer.nanoseconds-lost @@ source/os_extensions/nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.cpp @@ state.expiry.tv_nsec = static_cast<int32_t>(ns - seconds * kNsPerSecond); @@ state.expiry.tv_nsec = 0;
 # --- semaphores (include/quelta/RuntimeSemaphore.h, shared by the platform layer) ---
 semaphore.trim-last-post @@ include/quelta/RuntimeSemaphore.h @@ if (s->count - s->waiters > 1) --s->count; @@ if (s->count - s->waiters >= 1) --s->count;
