@@ -57,37 +57,24 @@ int FutexWaitUntil(PalWakeWord& word, uint32_t expected, const timespec& deadlin
 #endif
 }
 
-bool Reached(const timespec& deadline) {
-    timespec now{};
-    clock_gettime(CLOCK_MONOTONIC, &now);
-    if (now.tv_sec != deadline.tv_sec) return now.tv_sec > deadline.tv_sec;
-    return now.tv_nsec >= deadline.tv_nsec;
-}
+// The kernel side of WakeableSleep (PalWake.h).
+struct FutexKernel {
+    static int Wait(PalWakeWord& word, uint32_t expected, const timespec& deadline) {
+        return FutexWaitUntil(word, expected, deadline);
+    }
+    static bool Reached(const timespec& deadline) {
+        timespec now{};
+        clock_gettime(CLOCK_MONOTONIC, &now);
+        if (now.tv_sec != deadline.tv_sec) return now.tv_sec > deadline.tv_sec;
+        return now.tv_nsec >= deadline.tv_nsec;
+    }
+};
 
 }  // namespace
 
 PalSleepResult PalWakeableSleepUntil(PalWakeWord& word, uint32_t snapshot, const timespec& deadline,
                                      bool (*interrupted)(void*), void* context) {
-    for (;;) {
-        if (word.sequence.load(std::memory_order_acquire) != snapshot) return PalSleepResult::kWoken;
-        const int rc = FutexWaitUntil(word, snapshot, deadline);
-        switch (rc) {
-            case ETIMEDOUT:
-                // The kernel's timer has expired, so the clock has passed the
-                // deadline; the check only guards against a kernel that says
-                // otherwise.
-                if (Reached(deadline)) return PalSleepResult::kDeadline;
-                break;
-            case 0:       // woken: by a waker, or spuriously (the word tells)
-            case EAGAIN:  // the word had moved before the kernel looked
-                break;
-            case EINTR:
-                if (interrupted != nullptr && interrupted(context)) return PalSleepResult::kWoken;
-                break;
-            default:
-                return PalSleepResult::kFailed;
-        }
-    }
+    return WakeableSleep<FutexKernel>(word, snapshot, deadline, interrupted, context);
 }
 
 void PalWakeNotify(PalWakeWord& word) {
