@@ -3,6 +3,7 @@
 #include <cstdint>
 
 #include "engine/ClockTimeOps.h"
+#include "engine/HandOff.h"
 #include "engine/LibraryFrame.h"
 #include "engine/LibraryUse.h"
 #include "engine/SchedulerState.h"
@@ -31,9 +32,7 @@ uint32_t StoreCallbackTime(AtomicClockTime& cell, uint64_t stored, uint64_t mono
 
 }  // namespace
 
-void RegisterTickCallbackImpl(QueltaTickCallbackFn fn) {
-    gTickCallback.store(fn, std::memory_order_release);
-}
+void RegisterTickCallbackImpl(QueltaTickCallbackFn fn) { PublishTickCallback<StdAtomics>(gTickCallback, fn); }
 
 void UnregisterTickCallbackImpl(QueltaTickCallbackFn fn) {
     QueltaTickCallbackFn registered = gTickCallback.exchange(nullptr, std::memory_order_acq_rel);
@@ -55,8 +54,7 @@ using namespace quelta;
 
 extern "C" QUELTA_EXPORT void quelta_iTSC_SetCallback(QueltaCallbackFn fn, void* arg) {
     // The argument first: the tick service reads the function, then its argument.
-    gCallbackArg.store(arg, std::memory_order_relaxed);
-    gCallbackFn.store(fn, std::memory_order_release);
+    PublishCallback<StdAtomics>(gCallbackFn, gCallbackArg, fn, arg);
 }
 
 extern "C" QUELTA_EXPORT uint32_t quelta_iTSC_SetCallbackTime(const ClockTime* when, int32_t selector) {

@@ -7,6 +7,7 @@
 
 #include "engine/EngineDetail.h"
 #include "engine/EngineRate.h"
+#include "engine/HandOff.h"
 #include "engine/tKPusTimingEngine.h"
 #include "tLinux/PalMemory.h"
 #include "tLinux/PalThreads.h"
@@ -122,9 +123,8 @@ uint32_t tKPusTimingEngine::CalibrateWithin(uint32_t timeoutMs) {
     int32_t lastCount = 0;
     uint64_t lastAdvanceMs = MonotonicMs();
     for (;;) {
-        // Acquire pairs with the tick service's release of the count: the
-        // samples it counts are visible once the count is.
-        const int32_t n = statsCount.load(std::memory_order_acquire);
+        // The samples counted are visible once the count is (HandOff.h).
+        const int32_t n = SamplesCounted<StdAtomics>(statsCount);
         if (n >= static_cast<int32_t>(kStatsSamples)) break;
         if (timeoutMs != 0) {
             const uint64_t nowMs = MonotonicMs();

@@ -2,6 +2,7 @@
 // LibraryUse.h).
 #include "engine/LibraryUse.h"
 
+#include "engine/HandOff.h"
 #include "engine/WaitList.h"
 #include "quelta/RuntimeSemaphore.h"
 #include "tLinux/PalSemaphoreOps.h"
@@ -40,7 +41,7 @@ void Unlist(int32_t slot) {
     gBlocked[slot] = nullptr;
 }
 
-bool Stopping() { return gStopping.load(std::memory_order_seq_cst); }
+bool Stopping() { return StopBegun<StdAtomics>(gStopping); }
 
 // A waiter the stop cannot wake (no room in the list) waits at most
 // kUnlistedSliceMs at a time, so that it finds the stop well inside the
@@ -59,16 +60,10 @@ uint32_t WaitInSlices(PalSemaphore* semaphore, const timespec* deadline) {
 
 }  // namespace
 
-CallerInside::CallerInside() : entered_(true) {
-    gCallersInside.fetch_add(1, std::memory_order_seq_cst);
-    if (gStopping.load(std::memory_order_seq_cst)) {
-        gCallersInside.fetch_sub(1, std::memory_order_seq_cst);
-        entered_ = false;
-    }
-}
+CallerInside::CallerInside() : entered_(EnterUnlessStopping<StdAtomics>(gCallersInside, gStopping)) {}
 
 CallerInside::~CallerInside() {
-    if (entered_) gCallersInside.fetch_sub(1, std::memory_order_seq_cst);
+    if (entered_) LeaveInside<StdAtomics>(gCallersInside);
 }
 
 BlockResult BlockOn(PalSemaphore* semaphore, const timespec* deadline) {
@@ -97,10 +92,10 @@ void WakeBlockedWaiters() {
 
 bool WaitForCallersToLeave(uint32_t graceMs) {
     for (uint32_t ms = 0; ms < graceMs; ++ms) {
-        if (gCallersInside.load(std::memory_order_seq_cst) <= 0) return true;
+        if (NobodyInside<StdAtomics>(gCallersInside)) return true;
         PalSleepMilliseconds(1);
     }
-    return gCallersInside.load(std::memory_order_seq_cst) <= 0;
+    return NobodyInside<StdAtomics>(gCallersInside);
 }
 
 }  // namespace quelta

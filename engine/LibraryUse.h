@@ -27,7 +27,9 @@ namespace quelta {
 
 // Set (sequentially consistent) when the stop begins, cleared at start-up.
 extern std::atomic<bool> gStopping;
-// Callers inside node-using code right now.
+// Callers inside node-using code right now. Both words move only through
+// the sequentially consistent steps of HandOff.h (EnterUnlessStopping,
+// LeaveInside, BeginStop, NobodyInside).
 extern std::atomic<int32_t> gCallersInside;
 
 // Marks the caller inside for its scope; false (and not counted) once the

@@ -4,7 +4,9 @@
 // Every word is a relaxed atomic and every ClockTime a single 64-bit atomic,
 // so no reader sees a torn time and the state is data-race free. Decisions
 // that must agree with each other (list links, the arming of the earliest
-// deadline) are made under gSchedLock; see WaitList.h.
+// deadline) are made under gSchedLock; see WaitList.h. The callback words
+// are the exception: set and taken without the lock, they carry what the
+// setter wrote before, through the release/acquire pairs of HandOff.h.
 #ifndef QUELTA_ENGINE_SCHEDULERSTATE_H
 #define QUELTA_ENGINE_SCHEDULERSTATE_H
 
@@ -21,9 +23,9 @@ extern AtomicClockTime gTickPeriod;             // 0 at load, 1,000,000 at start
 extern AtomicClockTime gNextDeadline;           // armed / earliest found so far
 extern AtomicClockTime gMonotonicCallbackTime;  // NeverTime = none
 extern AtomicClockTime gGlobalCallbackTime;     // on the global clock
-extern std::atomic<QueltaCallbackFn> gCallbackFn;
+extern std::atomic<QueltaCallbackFn> gCallbackFn;       // PublishCallback / TakeCallback
 extern std::atomic<void*> gCallbackArg;
-extern std::atomic<QueltaTickCallbackFn> gTickCallback;
+extern std::atomic<QueltaTickCallbackFn> gTickCallback;  // PublishTickCallback / TakeTickCallback
 extern std::atomic<uint32_t> gGeneration;       // no writer in the library
 extern std::atomic<WaitNode*> gWaitNodePool;    // 128 nodes, or null
 extern std::atomic<WaitNode*> gFreeList;
