@@ -17,7 +17,7 @@ probe=(cmake g++ ninja-build nlohmann-json3-dev libcli11-dev)
 test=(make pkg-config googletest libgtest-dev libbenchmark-dev
       g++-arm-linux-gnueabihf libc6-dev-armhf-cross qemu-user util-linux binutils
       g++-i686-linux-gnu libc6-dev-i386-cross libc6-i386
-      dpkg-dev file lintian doxygen)
+      dpkg-dev file lintian doxygen relacy-dev)
 
 list=0
 [ "${1:-}" = --list ] && { list=1; shift; }
