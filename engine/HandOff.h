@@ -18,14 +18,14 @@ namespace quelta {
 // the setter wrote before setting them.
 
 template <class A, class FnWord, class ArgWord, class Fn>
-void PublishCallback(FnWord& fnWord, ArgWord& argWord, Fn fn, void* arg) {
+QUELTA_HANDOFF void PublishCallback(FnWord& fnWord, ArgWord& argWord, Fn fn, void* arg) {
     A::Store(argWord, arg, A::kRelaxed);
     A::Store(fnWord, fn, A::kRelease);
 }
 
 // The function (null: none) and, with one, its argument in `arg`.
 template <class A, class FnWord, class ArgWord>
-auto TakeCallback(const FnWord& fnWord, const ArgWord& argWord, void*& arg) {
+QUELTA_HANDOFF auto TakeCallback(const FnWord& fnWord, const ArgWord& argWord, void*& arg) {
     const auto fn = A::Load(fnWord, A::kAcquire);
     arg = fn != nullptr ? A::Load(argWord, A::kRelaxed) : nullptr;
     return fn;
@@ -36,12 +36,12 @@ auto TakeCallback(const FnWord& fnWord, const ArgWord& argWord, void*& arg) {
 // by the tick that calls the function.
 
 template <class A, class W, class Fn>
-void PublishTickCallback(W& word, Fn fn) {
+QUELTA_HANDOFF void PublishTickCallback(W& word, Fn fn) {
     A::Store(word, fn, A::kRelease);
 }
 
 template <class A, class W>
-auto TakeTickCallback(const W& word) {
+QUELTA_HANDOFF auto TakeTickCallback(const W& word) {
     return A::Load(word, A::kAcquire);
 }
 
@@ -52,7 +52,7 @@ auto TakeTickCallback(const W& word) {
 // Records `value` as the next of `size` samples; false when they are full
 // (or the count is negative).
 template <class A, class Sample, class Count>
-bool RecordSample(Sample* samples, uint32_t size, Count& count, uint32_t value) {
+QUELTA_HANDOFF bool RecordSample(Sample* samples, uint32_t size, Count& count, uint32_t value) {
     const int32_t n = A::Load(count, A::kRelaxed);
     if (n < 0 || n >= static_cast<int32_t>(size)) return false;
     A::Store(samples[n], value, A::kRelaxed);
@@ -75,7 +75,7 @@ int32_t SamplesCounted(const Count& count) {
 // the caller did inside before whatever the stop destroys.
 
 template <class A, class Count, class Flag>
-bool EnterUnlessStopping(Count& inside, const Flag& stopping) {
+QUELTA_HANDOFF bool EnterUnlessStopping(Count& inside, const Flag& stopping) {
     A::FetchAdd(inside, 1, A::kSeqCst);
     if (!A::Load(stopping, A::kSeqCst)) return true;
     A::FetchAdd(inside, -1, A::kSeqCst);
@@ -83,22 +83,22 @@ bool EnterUnlessStopping(Count& inside, const Flag& stopping) {
 }
 
 template <class A, class Count>
-void LeaveInside(Count& inside) {
+QUELTA_HANDOFF void LeaveInside(Count& inside) {
     A::FetchAdd(inside, -1, A::kSeqCst);
 }
 
 template <class A, class Flag>
-void BeginStop(Flag& stopping) {
+QUELTA_HANDOFF void BeginStop(Flag& stopping) {
     A::Store(stopping, true, A::kSeqCst);
 }
 
 template <class A, class Flag>
-bool StopBegun(const Flag& stopping) {
+QUELTA_HANDOFF bool StopBegun(const Flag& stopping) {
     return A::Load(stopping, A::kSeqCst);
 }
 
 template <class A, class Count>
-bool NobodyInside(const Count& inside) {
+QUELTA_HANDOFF bool NobodyInside(const Count& inside) {
     return A::Load(inside, A::kSeqCst) <= 0;
 }
 
@@ -110,17 +110,17 @@ bool NobodyInside(const Count& inside) {
 // Withdrawing (acq_rel) hands the object to the stop, which destroys it.
 
 template <class A, class W, class T>
-void Publish(W& word, T value) {
+QUELTA_HANDOFF void Publish(W& word, T value) {
     A::Store(word, value, A::kRelease);
 }
 
 template <class A, class W>
-auto Published(const W& word) {
+QUELTA_HANDOFF auto Published(const W& word) {
     return A::Load(word, A::kAcquire);
 }
 
 template <class A, class W>
-auto Withdraw(W& word) {
+QUELTA_HANDOFF auto Withdraw(W& word) {
     return A::Exchange(word, nullptr, A::kAcqRel);
 }
 

@@ -65,7 +65,7 @@ BasicLogEntry<A>* BuildRing(void* block, uint32_t capacity) {
 // Configure: hands a built heap ring to the recorders of `record`. Release:
 // the header and the entries before the pointer.
 template <class A>
-void PublishRing(BasicLogCpuRecord<A>& record, BasicLogEntry<A>* entries, uint32_t capacity) {
+QUELTA_HANDOFF void PublishRing(BasicLogCpuRecord<A>& record, BasicLogEntry<A>* entries, uint32_t capacity) {
     A::Store(record.capacity, capacity, A::kRelaxed);
     A::Store(record.entries, entries, A::kRelease);
 }
@@ -75,7 +75,7 @@ void PublishRing(BasicLogCpuRecord<A>& record, BasicLogEntry<A>* entries, uint32
 // on: the inline ring's size is known from its address, a heap ring's is
 // read from its own header through the pointer just loaded.
 template <class A>
-BasicLogRing<A> RecorderRing(BasicLogCpuRecord<A>& record) {
+QUELTA_HANDOFF BasicLogRing<A> RecorderRing(BasicLogCpuRecord<A>& record) {
     BasicLogEntry<A>* entries = A::Load(record.entries, A::kDependency);
     if (entries == record.inlineEntries) return BasicLogRing<A>{entries, kLogInlineCapacity};
     if (entries == nullptr) return BasicLogRing<A>{nullptr, 0};
@@ -91,7 +91,8 @@ BasicLogRing<A> RecorderRing(BasicLogCpuRecord<A>& record) {
 // Configure or read-out can tear an entry but never send a store outside
 // the ring; the check word lets the read-out recognise such a tear.
 template <class A>
-void RecordEntry(BasicLogCpuRecord<A>& record, uint32_t low, uint32_t high, uint32_t event, uint32_t data) {
+QUELTA_HANDOFF void RecordEntry(BasicLogCpuRecord<A>& record, uint32_t low, uint32_t high, uint32_t event,
+                                uint32_t data) {
     const BasicLogRing<A> ring = RecorderRing(record);
     if (ring.capacity == 0) return;
     uint32_t slot = A::Load(record.writeIndex, A::kRelaxed);
@@ -117,14 +118,14 @@ struct LogPublished {
 // The read-out's first step for each frozen ring; after the last of them,
 // AfterPublishedLoads, then the entries.
 template <class A>
-LogPublished LoadPublished(const BasicLogCpuRecord<A>& record) {
+QUELTA_HANDOFF LogPublished LoadPublished(const BasicLogCpuRecord<A>& record) {
     return LogPublished{A::Load(record.writeIndex, A::kRelaxed), A::Load(record.wrapCount, A::kRelaxed)};
 }
 
 // One acquire fence for all the rings: it pairs with each recorder's store
 // fence before the index or wrap count loaded.
 template <class A>
-void AfterPublishedLoads() {
+QUELTA_HANDOFF void AfterPublishedLoads() {
     A::Fence(A::kAcquire);
 }
 
@@ -137,7 +138,7 @@ struct LogCursor {
     uint32_t remaining;
 };
 
-inline LogCursor StartCursor(const LogPublished& published, uint32_t capacity) {
+QUELTA_HANDOFF LogCursor StartCursor(const LogPublished& published, uint32_t capacity) {
     uint32_t remaining = published.wrapCount != 0 ? capacity : published.writeIndex;
     if (remaining > capacity) remaining = capacity;
     uint32_t pos = published.writeIndex - 1;
@@ -156,7 +157,7 @@ struct LogEntryWords {
 // Reads one entry; false when its check word does not match (torn by a
 // recorder still writing into the frozen ring, or never written).
 template <class A>
-bool ReadEntry(const BasicLogEntry<A>& entry, LogEntryWords& out) {
+QUELTA_HANDOFF bool ReadEntry(const BasicLogEntry<A>& entry, LogEntryWords& out) {
     out.low = A::Load(entry.timeLow, A::kRelaxed);
     out.high = A::Load(entry.timeHigh, A::kRelaxed);
     out.event = A::Load(entry.event, A::kRelaxed);

@@ -56,18 +56,18 @@ enum class PalSleepResult {
 
 // The snapshot to sleep on: take it together with the work it covers.
 template <class A>
-uint32_t WakeSnapshot(const BasicWakeWord<A>& word) {
+QUELTA_HANDOFF uint32_t WakeSnapshot(const BasicWakeWord<A>& word) {
     return A::Load(word.sequence, A::kAcquire);
 }
 inline uint32_t PalWakeSnapshot(const PalWakeWord& word) { return WakeSnapshot(word); }
 
 template <class A>
-bool WakeMovedSince(const BasicWakeWord<A>& word, uint32_t snapshot) {
+QUELTA_HANDOFF bool WakeMovedSince(const BasicWakeWord<A>& word, uint32_t snapshot) {
     return A::Load(word.sequence, A::kAcquire) != snapshot;
 }
 
 template <class A>
-void WakeMove(BasicWakeWord<A>& word) {
+QUELTA_HANDOFF void WakeMove(BasicWakeWord<A>& word) {
     A::FetchAdd(word.sequence, 1u, A::kRelease);
 }
 
