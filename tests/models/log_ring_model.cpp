@@ -29,7 +29,8 @@ struct RingBlock {
 // A record as the engine's constructor leaves it: no heap ring, every word
 // written.
 void InitRecord(Record& record) {
-    for (auto* word : {&record.capacity, &record.writeIndex, &record.wrapCount, &record.readPos, &record.readRemaining}) {
+    for (auto* word : {&record.capacity, &record.writeIndex, &record.wrapCount, &record.readPos,
+                       &record.readRemaining}) {
         word->store(0, rl::mo_relaxed, $);
     }
     record.entries.store(nullptr, rl::mo_relaxed, $);
@@ -118,8 +119,8 @@ struct RingPublished : rl::test_suite<RingPublished, 2> {
 };
 
 const models::Case kCases[] = {
-    {"log entries published by the write index", &models::Simulate<EntriesPublished>, 2},
-    {"log ring published to recorders", &models::Simulate<RingPublished>, 2},
+    {"log entries published by the write index", &models::Simulate<EntriesPublished>, 3},
+    {"log ring published to recorders", &models::Simulate<RingPublished>, 4},
 };
 
 }  // namespace
