@@ -89,6 +89,10 @@ TEST_P(KextGlobal, GlobalDeadlinesEndAtTheConvertedTimeWithoutSpinning) {
                           << " conversions";
             continue;
         }
+        std::printf("%s, skew %+lld s: ended %.0f us after its deadline, %lld conversions by the caller\n", kinds[k],
+                    static_cast<long long>(GetParam() / static_cast<int64_t>(kSec)),
+                    (static_cast<double>(end) - static_cast<double>(due)) / 1e3,
+                    static_cast<long long>(d[kConvertByCallers]));
         if (end < due) {
             ADD_FAILURE() << "ended " << (due - end) / kUs << " us before its deadline";
         } else {

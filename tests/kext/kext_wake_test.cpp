@@ -88,7 +88,7 @@ TEST_P(KextWakeFallback, WarningOnceAndSigalrmOnEachWakeOnlyWhenTheCallAnswers38
         LoadedLibrary lib;
         for (int i = 0; lib.ok() && i < 30; ++i) {
             uint64_t deadline;
-            const uint64_t end = CallbackAfter(lib, 300 * kUs + (i * 23 % 400) * kUs, deadline);
+            const uint64_t end = CallbackAfter(lib, 100 * kUs + (i * 23 % 200) * kUs, deadline);
             if (end == 0) break;  // the timer thread serves nothing
             worst = std::max(worst, end - deadline);
             ++served;
