@@ -156,31 +156,9 @@ inline const char* RunAll(const Case* cases, size_t n, bool quiet) {
     return nullptr;
 }
 
-inline const char* OrderName(rl::memory_order o) {
-    switch (o) {
-        case rl::mo_relaxed: return "relaxed";
-        case rl::mo_consume: return "consume";
-        case rl::mo_acquire: return "acquire";
-        case rl::mo_release: return "release";
-        case rl::mo_acq_rel: return "acq_rel";
-        default: return "seq_cst";
-    }
-}
-
-// The weakenings tried at a site: relaxed, and for a sequentially consistent
-// operation first the acquire/release order of its kind. Returns how many.
-inline size_t WeakerOrders(const Site& s, rl::memory_order (&orders)[2]) {
-    size_t n = 0;
-    if (s.order == rl::mo_seq_cst) {
-        orders[n++] = s.kind == 'l' ? rl::mo_acquire : s.kind == 's' ? rl::mo_release : rl::mo_acq_rel;
-    }
-    orders[n++] = rl::mo_relaxed;
-    return n;
-}
-
 // Without arguments: runs every case, exit status 0 when all hold. With
-// --weaken-each: one line per ordered call site and weaker order, naming
-// the case that caught it (or "NOT caught").
+// --weaken-each: one line per ordered call site (file:line, kind, order) and
+// weaker order, naming the case that caught it, or "NOT caught".
 inline int RunModels(int argc, char** argv, const Case* cases, size_t n) {
     if (argc < 2 || std::strcmp(argv[1], "--weaken-each") != 0) return RunAll(cases, n, false) == nullptr ? 0 : 1;
     Weakening& w = Weak();
@@ -188,15 +166,19 @@ inline int RunModels(int argc, char** argv, const Case* cases, size_t n) {
     if (RunAll(cases, n, true) != nullptr) return 1;
     w.recording = false;
     for (size_t i = 0; i < w.count; ++i) {
+        // Relaxed, and for a sequentially consistent operation first the
+        // acquire/release order of its kind.
         const Site& site = w.seen[i];
-        rl::memory_order orders[2];
-        const size_t tries = WeakerOrders(site, orders);
-        for (size_t k = 0; k < tries; ++k) {
+        const rl::memory_order paired = site.kind == 'l' ? rl::mo_acquire
+                                        : site.kind == 's' ? rl::mo_release
+                                                           : rl::mo_acq_rel;
+        const rl::memory_order tries[] = {paired, rl::mo_relaxed};
+        for (size_t k = site.order == rl::mo_seq_cst ? 0 : 1; k < 2; ++k) {
             w.weakened = &site;
-            w.to = orders[k];
+            w.to = tries[k];
             const char* caught = RunAll(cases, n, true);
-            std::printf("%s:%d %c %s -> %s: %s%s\n", site.file, site.line, site.kind, OrderName(site.order),
-                        OrderName(orders[k]), caught ? "caught by " : "NOT caught", caught ? caught : "");
+            std::printf("%s:%d %c %s -> %s: %s%s\n", site.file, site.line, site.kind, rl::format(site.order),
+                        rl::format(w.to), caught ? "caught by " : "NOT caught", caught ? caught : "");
         }
     }
     w.weakened = nullptr;
