@@ -35,8 +35,10 @@ namespace quelta {
 // What the orders carry: work handed over under the sleeper's lock needs
 // none of them (the lock orders it, and the kernel compares the word under
 // its own lock). A flag set without that lock before a PalWake (the timer's
-// stop request) is seen by a sleeper that sees the word move: the release of
-// the move pairs with the acquire of that look.
+// stop request) is seen by a sleeper whose snapshot sees the word move: the
+// release of the move pairs with the snapshot's acquire. (The look before
+// each sleep acquires too, for a sleeper that acts on kWoken without taking
+// a new snapshot first; the timer thread always takes one.)
 template <class A>
 struct BasicWakeWord {
     typename A::template Atomic<uint32_t> sequence{0};
