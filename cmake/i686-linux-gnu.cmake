@@ -25,7 +25,10 @@ file(MAKE_DIRECTORY "${QUELTA_I686_RUNTIME_DIR}")
 foreach(lib libstdc++.so.6 libgcc_s.so.1)
   file(CREATE_LINK "/usr/i686-linux-gnu/lib/${lib}" "${QUELTA_I686_RUNTIME_DIR}/${lib}" SYMBOLIC)
 endforeach()
-# The library finds them relative to itself, so that it carries no path of
-# the build machine (it lies beside that directory in the build tree).
-set(CMAKE_EXE_LINKER_FLAGS_INIT "-Wl,-rpath,${QUELTA_I686_RUNTIME_DIR}")
-set(CMAKE_SHARED_LINKER_FLAGS_INIT "-Wl,-rpath,'$ORIGIN/i686-runtime'")
+# The build tree's programs find them through their run path, the library
+# relative to itself, so that it carries no path of the build machine (it
+# lies beside that directory). Both are build-tree run paths, which
+# installing removes: the installed and packaged files name no such
+# directory (the target system has a C++ runtime of its own).
+set(CMAKE_BUILD_RPATH "${QUELTA_I686_RUNTIME_DIR}")
+set(QUELTA_LIBRARY_BUILD_RPATH "$ORIGIN/i686-runtime")
