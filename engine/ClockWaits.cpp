@@ -9,6 +9,7 @@
 #include <time.h>
 
 #include "engine/ClockTimeOps.h"
+#include "engine/HandOff.h"
 #include "engine/LibraryFrame.h"
 #include "engine/SystemClock.h"
 #include "engine/U64Arith.h"
@@ -26,7 +27,7 @@ constexpr uint64_t kClocksPerSecond = 1000000000ull;
 // the waits still work on the kernel clock directly instead of faulting.
 ClockTime ReadNow() {
     ClockTime now{0, 0};
-    tKPusTimingEngine* engine = gEngine.load(std::memory_order_relaxed);
+    tKPusTimingEngine* engine = Published<StdAtomics>(gEngine);
     if (engine != nullptr) {
         engine->ReadMonotonic4(now);
         return now;

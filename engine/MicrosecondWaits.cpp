@@ -8,6 +8,7 @@
 
 #include "engine/ClockTimeOps.h"
 #include "engine/ClockWaits.h"
+#include "engine/HandOff.h"
 #include "engine/LibraryFrame.h"
 #include "engine/U64Arith.h"
 #include "engine/tKPusTimingEngine.h"
@@ -25,7 +26,7 @@ constexpr uint32_t kPastToleranceUs = 1000;
 // Without an engine (the library failed to start) the kernel clock is read
 // directly and divided plainly, so that the waits still work.
 ClockTime NowMicroseconds() {
-    tKPusTimingEngine* engine = gEngine.load(std::memory_order_relaxed);
+    tKPusTimingEngine* engine = Published<StdAtomics>(gEngine);
     if (engine != nullptr) {
         ClockTime now{0, 0};
         engine->ReadMonotonic4(now);
@@ -38,7 +39,7 @@ ClockTime NowMicroseconds() {
 }
 
 ClockTime MicrosecondsToClocks(const ClockTime& us) {
-    tKPusTimingEngine* engine = gEngine.load(std::memory_order_relaxed);
+    tKPusTimingEngine* engine = Published<StdAtomics>(gEngine);
     if (engine != nullptr) return engine->MicrosecondsToClocks64Fwd(us);
     ClockTime clocks = us;
     U64MulU32(clocks, 1000);

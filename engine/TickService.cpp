@@ -16,6 +16,7 @@
 #include "engine/TickService.h"
 
 #include "engine/ClockTimeOps.h"
+#include "engine/HandOff.h"
 #include "engine/LibraryFrame.h"
 #include "engine/SchedulerState.h"
 #include "engine/TimerArming.h"
@@ -44,9 +45,9 @@ uint64_t ReadNow(iKPusTimingEngine* engine) {
 }
 
 void CallCallback(const ClockTime* now) {
-    QueltaCallbackFn fn = gCallbackFn.load(std::memory_order_acquire);
+    void* arg = nullptr;
+    QueltaCallbackFn fn = TakeCallback<StdAtomics>(gCallbackFn, gCallbackArg, arg);
     if (fn == nullptr) return;
-    void* arg = gCallbackArg.load(kRelaxed);
     fn(arg != nullptr ? arg : const_cast<ClockTime*>(now));
 }
 
@@ -63,11 +64,8 @@ bool ServeTickLocked(tKPusTimingEngine* engine, uint64_t now) {
     uint64_t nextTick = gNextTick.Load();
     if (Due(nextTick, now)) {
         if (engine->statsEnabled.load(kRelaxed) != 0) {
-            int32_t count = engine->statsCount.load(kRelaxed);
-            if (count >= 0 && count < static_cast<int32_t>(kStatsSamples)) {
-                engine->stats.jitterSamples[count].store(static_cast<uint32_t>(now - nextTick), kRelaxed);
-                engine->statsCount.store(count + 1, std::memory_order_release);
-            }
+            RecordSample<StdAtomics>(engine->stats.jitterSamples, kStatsSamples, engine->statsCount,
+                                     static_cast<uint32_t>(now - nextTick));
         }
         nextTick += gTickPeriod.Load();
         // Missed ticks are not replayed: the grid restarts from the present.
@@ -110,7 +108,7 @@ void ResetTickServiceState() {
 }
 
 void TickServiceRoutine() {
-    tKPusTimingEngine* engine = gEngine.load(std::memory_order_acquire);
+    tKPusTimingEngine* engine = Published<StdAtomics>(gEngine);
     if (engine == nullptr) return;
     iKPusTimingEngine* slots = engine;
     if (!sGenerationSeen.load(kRelaxed)) {
@@ -185,7 +183,7 @@ void TickServiceRoutine() {
         if (work.callGlobal) CallCallback(&nowTime);
         for (uint32_t i = 0; i < work.fired; ++i) work.release[i] = RunFiring(work.batch[i]);
         if (work.tickDue) {
-            QueltaTickCallbackFn tick = gTickCallback.load(std::memory_order_acquire);
+            QueltaTickCallbackFn tick = TakeTickCallback<StdAtomics>(gTickCallback);
             if (tick != nullptr) {
                 tick(sTickSerial.load(kRelaxed));
                 sTickSerial.fetch_add(1, kRelaxed);
