@@ -292,8 +292,9 @@ OUTPUT
     measured: ...". For the baseline and every series not as good as the
     machine the verdict adds "machine stalls explain the tail" (its p99 is
     within the baseline's p50 plus the stall p99 around it) or "tail N us
-    beyond machine stalls". Then a table of call costs and notes. While the survey runs, a progress
-    line is shown when standard output is a terminal.
+    beyond machine stalls". Then a table of call costs and notes. While the
+    survey runs, a progress line is shown when standard output is a
+    terminal.
 
 EXIT STATUS
     0   the survey ran (or was ended by a signal); no wait returned early;

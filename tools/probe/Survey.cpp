@@ -364,20 +364,10 @@ void Worker::Run() {
         }
     }
 
-    // The survey.
-    log->SetEnabled(1);
-    log->LogNow5(EventWord(kSurveyItself, kKindStart));
-    for (uint32_t id : order) log->LogNow5(EventWord(id, kKindStart));
-    ticks.log = log;
-    if (out.timerRunning) {
-        log->LogNow5(EventWord(kTick, kKindStart));
-        gTicks.store(&ticks, std::memory_order_release);
-        engine->RegisterTickCallback(&OnTick);
-    }
-
-    // The machine's stalls, measured beside the series; on a spare CPU only
-    // by a real-time thread (at normal priority it would measure the
-    // scheduler's sharing, not the machine).
+    // The machine's stalls, measured beside the series (its figures are
+    // allocated here, before the survey); on a spare CPU only by a real-time
+    // thread (at normal priority it would measure the scheduler's sharing,
+    // not the machine).
     MachineNoise noise(kSeriesCount, timerTid);
     if (config.noise == NoiseMode::SpareCpu && !out.realtime) {
         out.notes.push_back("machine stalls measured in windows on the survey's CPU: a spare CPU needs real-time "
@@ -389,6 +379,17 @@ void Worker::Run() {
         noise.UseWindows();
     } else if (config.noise == NoiseMode::Windows) {
         noise.UseWindows();
+    }
+
+    // The survey.
+    log->SetEnabled(1);
+    log->LogNow5(EventWord(kSurveyItself, kKindStart));
+    for (uint32_t id : order) log->LogNow5(EventWord(id, kKindStart));
+    ticks.log = log;
+    if (out.timerRunning) {
+        log->LogNow5(EventWord(kTick, kKindStart));
+        gTicks.store(&ticks, std::memory_order_release);
+        engine->RegisterTickCallback(&OnTick);
     }
 
     const int64_t start = MonoNs();
