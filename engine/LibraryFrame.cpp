@@ -12,6 +12,7 @@
 
 #include "engine/ClockTimeOps.h"
 #include "engine/EpochOffset.h"
+#include "engine/HandOff.h"
 #include "engine/LibraryUse.h"
 #include "engine/SchedulerState.h"
 #include "engine/TickService.h"
@@ -39,7 +40,7 @@ constexpr const char* kConvertSyscallFile = "/sys/kernel/zq_syscall_clock_conver
 constexpr const char* kInitFailed = "iTSCEvent_Initialize_C FAILED!";
 
 void DeleteLogEngine() {
-    iKPLogEngine* log = gLogEngine.exchange(nullptr, std::memory_order_acq_rel);
+    iKPLogEngine* log = Withdraw<StdAtomics>(gLogEngine);
     delete log;  // through the virtual deleting destructor
 }
 
@@ -50,7 +51,7 @@ void DeleteTimer() {
     iKPusLinuxTimer* timer;
     {
         SchedLockGuard lock;
-        timer = gTimer.exchange(nullptr, std::memory_order_acq_rel);
+        timer = Withdraw<StdAtomics>(gTimer);
     }
     delete timer;  // stops and joins its thread
 }
@@ -72,7 +73,7 @@ uint32_t LibraryControl(uintptr_t, uintptr_t command, uintptr_t) {
     if (command != 0) return 1;
     // From here no caller enters node-using code, and any that is inside and
     // blocks gives up (see LibraryUse.h).
-    gStopping.store(true, std::memory_order_seq_cst);
+    BeginStop<StdAtomics>(gStopping);
     DeleteTimer();
     EventSystemStop();
     DeleteLogEngine();
@@ -86,12 +87,12 @@ uint32_t LibraryStart() {
         std::puts("Log engine initialization FAILED!");
         return 0;
     }
-    gLogEngine.store(log, std::memory_order_release);
+    Publish<StdAtomics>(gLogEngine, log);
 
     ReadConvertSyscallNumber();
 
     tKPusLinuxNanoSleepTimer* timer = new tKPusLinuxNanoSleepTimer();
-    if (timer != nullptr) gTimer.store(timer, std::memory_order_release);
+    if (timer != nullptr) Publish<StdAtomics>(gTimer, timer);
     if (timer == nullptr || static_cast<iKPusLinuxTimer*>(timer)->Initialize(TickServiceRoutine) != 0) {
         std::puts(kInitFailed);
         DeleteLogEngine();
@@ -106,7 +107,7 @@ uint32_t LibraryStart() {
         return 0;
     }
     engine->serviceMode.store(0, kRelaxed);  // waits go through the tick service
-    gEngine.store(engine, std::memory_order_release);
+    Publish<StdAtomics>(gEngine, engine);
 
     gCpuSpeed.store(static_cast<iKPusLinuxTimer*>(timer)->GetTicksPerMicrosecond(), kRelaxed);
 
@@ -139,10 +140,10 @@ uint32_t EventSystemStart() {
         PalSemaphoreWait(semaphore, 0);
         pool[i].ownSemaphore.store(semaphore, kRelaxed);
     }
-    gEventSystemReady.store(1, std::memory_order_release);
+    Publish<StdAtomics>(gEventSystemReady, 1u);
 
     // First tick, one period from now; from here the timer thread ticks.
-    tKPusTimingEngine* engine = gEngine.load(std::memory_order_acquire);
+    tKPusTimingEngine* engine = Published<StdAtomics>(gEngine);
     ClockTime now;
     static_cast<iKPusTimingEngine*>(engine)->ReadMonotonic5(now);
     {
@@ -183,7 +184,7 @@ void EventSystemStop() {
     } else {
         everyoneLeft = WaitForCallersToLeave(kStopWaiterGraceMs);
     }
-    iKPusTimingEngine* engine = gEngine.exchange(nullptr, std::memory_order_acq_rel);
+    iKPusTimingEngine* engine = Withdraw<StdAtomics>(gEngine);
     if (everyoneLeft) {
         delete engine;
     } else {
@@ -200,9 +201,9 @@ void EventSystemStop() {
 using namespace quelta;
 
 extern "C" QUELTA_EXPORT iKPusTimingEngine* GetEngine__MERIDOX(void) {
-    return gEngine.load(std::memory_order_acquire);
+    return Published<StdAtomics>(gEngine);
 }
 
 extern "C" QUELTA_EXPORT iKPLogEngine* GetLogEngine__MERIDOX(void) {
-    return gLogEngine.load(std::memory_order_acquire);
+    return Published<StdAtomics>(gLogEngine);
 }
