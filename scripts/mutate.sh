@@ -159,6 +159,12 @@ semaphore.timed-out-takes @@ include/quelta/RuntimeSemaphore.h @@ result = aband
 # --- the stop (engine/LibraryUse.cpp) ---
 stop.unlisted-never-looks @@ engine/LibraryUse.cpp @@ r = WaitInSlices(semaphore, deadline); @@ r = PalSemaphoreWaitUntilUnless(semaphore, deadline, &Stopping);
 # --- the kernel extension's calls, through its emulation (tests/kext) ---
+timer.blind-sleep-unbounded @@ source/os_extensions/nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.cpp @@ const timespec until = Earliest(deadline, bound); @@ const timespec until = deadline;
+timer.late-wake-parks @@ source/os_extensions/nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.cpp @@             if (ExpirySetSince(state, takenCount)) return result;<NL>            continue; @@             return result;
+timer.deferred-wake-dropped @@ source/os_extensions/nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.cpp @@     for (; tOwedWakes != 0; --tOwedWakes) tOwedTimer->WakeDeferred(); @@     tOwedWakes = 0;
+list.placement-unchecked @@ engine/WaitList.cpp @@ if (!place.found || place.version != gWaitListVersion.load(kRelaxed)) place = @@ if (!place.found) place =
+list.unlink-unversioned @@ engine/WaitList.cpp @@     gWaitListVersion.fetch_add(1, std::memory_order_release);<NL>    CountQueued(node, -1); @@     CountQueued(node, -1);
+tick.idle-global-unconverted @@ engine/TickService.cpp @@ if (!needGlobal && GlobalNodesQueued()) continue; @@ (void)needGlobal;
 kext.convert-time-first @@ engine/SystemClock.cpp @@ return syscall(number, static_cast<long>(fromClock), static_cast<long>(toClock), time); @@ return syscall(number, time, static_cast<long>(fromClock), static_cast<long>(toClock));
 kext.convert-direction-swapped @@ engine/EngineConversion.cpp @@ ConvertClockTime(CLOCK_MONOTONIC, CLOCK_REALTIME, &ts); @@ ConvertClockTime(CLOCK_REALTIME, CLOCK_MONOTONIC, &ts);
 kext.wake-wrong-id @@ source/os_extensions/nsengine/tKPusLinuxNanoSleepTimer/tKPusLinuxNanoSleepTimer.cpp @@ if (nr >= 1) return static_cast<int32_t>(syscall(nr, state.threadId.load())); @@ if (nr >= 1) return static_cast<int32_t>(syscall(nr, getpid()));
