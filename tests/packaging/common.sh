@@ -1,7 +1,8 @@
 # Shared by the packaging tests. The test's CMake registration passes the
 # build's facts in the environment: BUILD_DIR SOURCE_DIR LIBDIR INCLUDEDIR
 # BINDIR MANDIR DATAROOTDIR VERSION DEB_VERSION DEB_ARCH HAS_PROBE CMAKE CPACK
-# CXX GENERATOR MAKE_PROGRAM.
+# CXX GENERATOR MAKE_PROGRAM, and for programs built for the target CROSS
+# (1 in a cross build), RUN_WITH (its emulator, if any) and EXE_LDFLAGS.
 set -euo pipefail
 # (With pipefail, never `cmd | grep -q`: grep quits at the first match and
 # cmd, killed by SIGPIPE, fails the pipeline. Send grep's output to
