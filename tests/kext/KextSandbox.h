@@ -80,6 +80,7 @@ public:
         page_->skewNs.store(0);
         page_->loseEveryWake.store(0);
         page_->widenWindowUs.store(0);
+        page_->echoWakes.store(0);
         page_->wakeReturnsEnosys.store(0);
     }
 

@@ -37,6 +37,7 @@ enum Counter : int {
     kOpensConvertFile,
     kTimerSleeps,        // clock_nanosleep calls of a timer thread, emulated
     kSleepsInterrupted,  // ... whose target was interrupted by a signal
+    kWakesEchoed,        // a delivered wake that also ended the thread's next sleep
     kCounterCount
 };
 
@@ -48,6 +49,7 @@ struct SharedPage {
     std::atomic<int32_t> loseEveryWake{0};     // the wake call does nothing
     std::atomic<int32_t> widenWindowUs{0};     // a sleep counts as asleep this long after it arrived
     std::atomic<int32_t> wakeReturnsEnosys{0};  // the wake call answers 38
+    std::atomic<int32_t> echoWakes{0};  // a delivered wake ends the next sleep too, as a late one would
     // Fixed by the supervisor before it serves: CLOCK_REALTIME minus
     // CLOCK_MONOTONIC and CLOCK_MONOTONIC_RAW minus CLOCK_MONOTONIC, measured
     // once, so that every conversion is an exact function of its input.

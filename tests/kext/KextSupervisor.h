@@ -197,6 +197,11 @@ private:
         // A thread is in one call at a time: an earlier sleep of it that is
         // still listed was ended by a signal.
         if (Sleep* old = SleepOf(tid)) End(*old, false);
+        if (tid == echoTid_) {  // the echo of a wake made before this sleep began
+            echoTid_ = 0;
+            page_->Add(kWakesEchoed);
+            return (void)Reply(n.id, -1, -EAGAIN);
+        }
         if (deadline <= now) return (void)Reply(n.id, 0, 0);
         Sleep* slot = SleepOf(0);
         if (slot == nullptr) return Continue(n.id);  // more timers than slots: let it sleep for real
@@ -219,6 +224,7 @@ private:
             NowNs(CLOCK_MONOTONIC) - s->arrived >= widen) {
             delivered = Valid(s->id) && Reply(s->id, -1, -EAGAIN);
             End(*s, delivered);
+            if (delivered && page_->echoWakes.load(std::memory_order_relaxed) != 0) echoTid_ = tid;
         }
         page_->Add(delivered ? kWakesDelivered : kWakesLost);
         Reply(n.id, 0, 0);
@@ -297,6 +303,7 @@ private:
     Sleep sleeps_[kMaxSleeps];
     int timers_[kMaxTimers] = {};
     unsigned nextTimer_ = 0;
+    int echoTid_ = 0;  // the thread whose next sleep a wake's echo ends
 };
 
 }  // namespace kext
