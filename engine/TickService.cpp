@@ -123,10 +123,10 @@ void TickServiceRoutine() {
         // neither converted nor folded). The global clock is consulted only
         // while something waits on it, so a pass at rest (the tick alone)
         // makes no conversion.
-        const uint64_t now = ReadNow(engine);
-        const ClockTime nowTime = FromU64(now);
         const uint64_t globalTime = gGlobalCallbackTime.Load();
         const bool needGlobal = !IsNever(globalTime) || GlobalNodesQueued();
+        const uint64_t now = ReadNow(engine);
+        const ClockTime nowTime = FromU64(now);
         const uint64_t nowGlobal = needGlobal ? ToU64(slots->MonotonicToGlobal(nowTime)) : now;
         const int64_t offset = GlobalOffsetOf(now, nowGlobal);
         const bool globalDue = Due(globalTime, nowGlobal);

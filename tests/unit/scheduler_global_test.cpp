@@ -14,6 +14,7 @@
 #include "engine/LibraryFrame.h"
 #include "engine/SchedulerState.h"
 #include "engine/SystemClock.h"
+#include "engine/TickService.h"
 #include "engine/WaitList.h"
 #include "engine/tKPusTimingEngine.h"
 #include "tLinux/PalSemaphoreOps.h"
@@ -66,6 +67,24 @@ protected:
     }
     SchedulerHarness h;
 };
+
+// A pass at rest makes no conversion; a global-clock node queued just as it
+// began (here: while it reads the clock) is still placed by the pass's own
+// conversion, so a due one fires in that pass.
+TEST_F(SchedulerGlobalNodes, ANodeQueuedAsAPassAtRestBeginsIsConverted) {
+    gEngine.load()->SetEpochOffset(100);
+    static decltype(this) self;
+    static WaitNode* arrived;
+    self = this;
+    arrived = nullptr;
+    gTickNowOverride = [] {
+        if (arrived == nullptr) arrived = self->QueueAt(self->h.Now() + 100 * kSecond - kMs, true);
+        return self->h.Now();
+    };
+    h.Pass();
+    ASSERT_NE(arrived, nullptr);
+    EXPECT_EQ(arrived->fireCount.load(), 1u);
+}
 
 // The harness's global clock is its monotonic clock plus the epoch offset.
 // With an offset of 100 s, a global deadline of 50 s lies 50 s before the
