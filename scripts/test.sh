@@ -33,10 +33,8 @@ cross() {  # name, toolchain, extra ctest args...: the benchmarks skip
   run "$name" "$@"
 }
 
-times=()
-for s in "${stages[@]}"; do
-  start=$SECONDS
-  case $s in
+stage() {
+  case $1 in
     native) build native -DCMAKE_BUILD_TYPE=RelWithDebInfo -DQUELTA_BUILD_BENCH=ON; run native ;;
     i686)   cross i686 i686-linux-gnu ;;
     armv7)  # probe_cli_test starts quelta-probe with execv, which runs an ARM
@@ -48,8 +46,20 @@ for s in "${stages[@]}"; do
             ASAN_OPTIONS=detect_leaks=1:abort_on_error=1 UBSAN_OPTIONS=print_stacktrace=1 run asan ;;
     tsan)   build tsan -DCMAKE_BUILD_TYPE=RelWithDebInfo -DQUELTA_SANITIZE=thread -DQUELTA_BUILD_BENCH=OFF
             TSAN_OPTIONS="halt_on_error=1 second_deadlock_stack=1" run tsan ;;
-    *) echo "unknown stage: $s" >&2; exit 2 ;;
   esac
+}
+for s in "${stages[@]}"; do
+  case $s in native|i686|armv7|asan|tsan) ;; *) echo "unknown stage: $s" >&2; exit 2 ;; esac
+done
+
+# Every stage runs, also after one has failed, so that one run shows them
+# all; the status is 1 when any failed.
+times=() failed=()
+for s in "${stages[@]}"; do
+  start=$SECONDS
+  set +e; (set -e; stage "$s"); rc=$?; set -e
+  [ "$rc" -eq 0 ] || failed+=("$s")
   times+=("$s=$((SECONDS - start))")
 done
 echo "stage times (s): ${times[*]}"
+if ((${#failed[@]})); then echo "failed stages: ${failed[*]}"; exit 1; fi
