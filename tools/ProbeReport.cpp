@@ -19,12 +19,6 @@ const SeriesResult* FindBaseline(const ProbeReport& r) {
     return nullptr;
 }
 
-std::string Cell(double v, const char* fmt = "%.1f") {
-    if (!std::isfinite(v)) return "-";
-    char buf[32];
-    std::snprintf(buf, sizeof buf, fmt, v);
-    return buf;
-}
 
 std::string Pad(const std::string& s, std::size_t width, bool right) {
     if (s.size() >= width) return s;
@@ -33,6 +27,13 @@ std::string Pad(const std::string& s, std::size_t width, bool right) {
 }
 
 }  // namespace
+
+std::string Cell(double v, const char* fmt) {
+    if (!std::isfinite(v)) return "-";
+    char buf[32];
+    std::snprintf(buf, sizeof buf, fmt, v);
+    return buf;
+}
 
 void FinishVerdicts(ProbeReport& report) {
     const SeriesResult* base = FindBaseline(report);

@@ -84,6 +84,8 @@ std::size_t LibraryEarlyCount(const ProbeReport& report);
 // The JSON document, indented by two spaces, ending in a newline.
 std::string ReportToJson(const ProbeReport& report);
 std::string FormatSeriesTable(const ProbeReport& report);
+// One table cell: `v` printed with `fmt`, or "-" when it is not a number.
+std::string Cell(double v, const char* fmt = "%.1f");
 // Rows of cells as a table: columns padded to their widest cell, the first
 // left-aligned and the others right-aligned (the last one left as it is),
 // a rule under the first row.

@@ -17,6 +17,7 @@ namespace qprobe {
 namespace {
 
 using json = nlohmann::json;
+using qtools::Cell;
 
 const char kUsage[] = "usage: quelta-probe compare A.json B.json  (files written by quelta-probe --json)\n";
 
@@ -61,12 +62,6 @@ const json* FindSeries(const json& doc, const std::string& name) {
     return nullptr;
 }
 
-std::string Cell(double v, const char* fmt = "%.1f") {
-    if (!std::isfinite(v)) return "-";
-    char buf[32];
-    std::snprintf(buf, sizeof buf, fmt, v);
-    return buf;
-}
 
 // One line on where and how a survey ran.
 std::string Describe(const char* label, const std::string& path, const json& doc) {

@@ -20,12 +20,6 @@ constexpr int64_t kTimerReadEveryNs = 100000;
 constexpr int64_t kSpinStretchNs = 900000000;  // then a rest, below the kernel's 95 % real-time share
 constexpr int64_t kRestNs = 100000000;
 
-int64_t MonoNs() {
-    timespec t{};
-    clock_gettime(CLOCK_MONOTONIC, &t);
-    return static_cast<int64_t>(t.tv_sec) * 1000000000LL + t.tv_nsec;
-}
-
 // CPU time of a thread, in ns, from its schedstat; -1 when not known.
 int64_t ThreadCpuNs(int fd) {
     if (fd < 0) return -1;
@@ -37,6 +31,12 @@ int64_t ThreadCpuNs(int fd) {
 }
 
 }  // namespace
+
+int64_t MonoNs() {
+    timespec t{};
+    clock_gettime(CLOCK_MONOTONIC, &t);
+    return static_cast<int64_t>(t.tv_sec) * 1000000000LL + t.tv_nsec;
+}
 
 pid_t LibraryTimerThread() {
     DIR* d = opendir("/proc/self/task");

@@ -36,6 +36,9 @@
 
 namespace qprobe {
 
+// CLOCK_MONOTONIC now, in ns.
+int64_t MonoNs();
+
 enum class NoiseMode { Off, Windows, SpareCpu };
 
 constexpr int64_t kStallThresholdNs = 5000;  // a gap above this counts as a stall

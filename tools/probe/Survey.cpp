@@ -40,12 +40,6 @@ const uint32_t kSampledSeries[] = {kBaseline, kEventOwnSem, kPlainWait, kEventTi
                                    kCallbackTime};
 const uint32_t kPlainSeries[] = {kBaseline, kPlainWait};
 
-int64_t MonoNs() {
-    timespec t{};
-    clock_gettime(CLOCK_MONOTONIC, &t);
-    return static_cast<int64_t>(t.tv_sec) * 1000000000LL + t.tv_nsec;
-}
-
 // Time this thread has spent runnable but not running, in ns (the kernel's
 // run delay), or -1 when the kernel does not keep it.
 int64_t RunDelayNs(int fd) {
