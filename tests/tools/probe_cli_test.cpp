@@ -376,6 +376,10 @@ TEST_F(ProbeCli, AStoppedMachineShowsAsStalls) {
     EXPECT_EQ(doc["machine_noise"]["mode"], "spare-cpu");
     EXPECT_EQ(doc["machine_noise"]["cpu"], 0);
     EXPECT_GE(doc["machine_noise"]["stall_max"].get<double>(), 50000.0) << doc["machine_noise"].dump();
+    // At least one series is charged a stop through a sample the stop made
+    // late. (A stop that lands while a series computes, between its wake and
+    // its record, is charged to that sample without making it late: under a
+    // sanitizer that computing is long enough to be hit.)
     int charged = 0;
     for (const json& s : doc["series"]) {
         // A series with no sample in the run (a loaded machine) has no figures.
@@ -383,8 +387,7 @@ TEST_F(ProbeCli, AStoppedMachineShowsAsStalls) {
             s["machine_stall_max"].get<double>() < 50000.0) {
             continue;
         }
-        ++charged;
-        EXPECT_GE(s["max"].get<double>(), 40000.0) << s.dump();
+        charged += s["max"].get<double>() >= 40000.0;
     }
     EXPECT_GE(charged, 1) << r.out;
 }
