@@ -29,8 +29,14 @@ extern std::atomic<QueltaTickCallbackFn> gTickCallback;  // PublishTickCallback 
 extern std::atomic<uint32_t> gGeneration;       // no writer in the library
 extern std::atomic<WaitNode*> gWaitNodePool;    // 128 nodes, or null
 extern std::atomic<WaitNode*> gFreeList;
+// Written only under gSchedLock (release); an insert's placement walk reads
+// it, and the nodes' next links, without the lock (acquire).
 extern std::atomic<WaitNode*> gWaitList;
 extern std::atomic<uint32_t> gEventSystemReady;
+// Moved (release, under gSchedLock) after every change of the wait list's
+// shape: link, unlink, detach. An insert reads it (acquire) before its
+// lock-free placement walk and takes the place found only when it still
+// reads the same under the lock.
 extern std::atomic<uint32_t> gWaitListVersion;
 extern std::atomic<uint32_t> gControlFlag;
 
