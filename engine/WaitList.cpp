@@ -417,7 +417,6 @@ uint32_t ReleaseWaitNodeReport(WaitNode* node) {
 
 // Under the lock: the node leaves the wait list and is marked as firing.
 static void DetachForFiring(WaitNode* node) {
-    gWaitListVersion.fetch_add(1, kRelaxed);
     node->fireCount.fetch_add(1, std::memory_order_release);
     UnlinkQueued(node);
     node->releasePending.store(0, kRelaxed);
