@@ -15,11 +15,15 @@
 # reported and not counted.
 #
 # Usage: scripts/mutate.sh [--check] [--list] [--unit-only] [--only ID[,ID...]] [--jobs N]
+#                          [--work DIR] [--tests REGEX]
 #   --check      only verify that every mutant's text occurs exactly once
 #   --list       print the mutants
 #   --unit-only  run the unit label only (quick, a lower bound of the score;
 #                the i686 mutants are left out)
 #   --only       run the named mutants (and the baseline)
+#   --work       the scratch directory (default build/mutation), so that two
+#                runs can go side by side
+#   --tests      run only the tests whose names match REGEX
 #
 # Format of the list: `id @@ file @@ original text @@ mutated text`, one per
 # line; `<NL>` stands for a line break. The original text must occur exactly
@@ -28,7 +32,7 @@ set -uo pipefail
 root=$(cd "$(dirname "$0")/.." && pwd)
 work=$root/build/mutation
 
-check_only=0 list_only=0 unit_only=0 only="" jobs=2
+check_only=0 list_only=0 unit_only=0 only="" jobs=2 tests=""
 while [ $# -gt 0 ]; do
   case $1 in
     --check) check_only=1 ;;
@@ -36,7 +40,9 @@ while [ $# -gt 0 ]; do
     --unit-only) unit_only=1 ;;
     --only) only=$2; shift ;;
     --jobs) jobs=$2; shift ;;
-    *) echo "usage: $0 [--check] [--list] [--unit-only] [--only ID[,ID...]] [--jobs N]" >&2; exit 2 ;;
+    --work) work=$(realpath -m "$2"); shift ;;
+    --tests) tests=$2; shift ;;
+    *) echo "usage: $0 [--check] [--list] [--unit-only] [--only ID[,ID...]] [--jobs N] [--work DIR] [--tests REGEX]" >&2; exit 2 ;;
   esac
   shift
 done
@@ -264,6 +270,7 @@ stage_timeout() { [ "$1" = unit ] && echo 240 || echo 480; }
 run_stage() {
   local label=$1 log=$2 exclude=$3 dir=$4 args=()
   [ -n "$exclude" ] && args=(-E "$exclude")
+  [ -n "$tests" ] && args+=(-R "$tests")
   # A mutant can turn a loop into a runaway that allocates without end: each
   # test gets 4 GB of address space, far more than any needs.
   (ulimit -v 4194304
@@ -285,7 +292,7 @@ baseline() {
   local dir=$1 name=native label failing=()
   [ "$dir" = "$work/build" ] || name=i686
   for label in $(stages_of "$dir"); do
-    (ulimit -v 4194304; timeout -k 10 600 ctest --test-dir "$dir" -L "$label" -LE 'long|hostclock') \
+    (ulimit -v 4194304; timeout -k 10 600 ctest --test-dir "$dir" -L "$label" -LE 'long|hostclock' ${tests:+-R "$tests"}) \
       >"$work/logs/baseline-$name-$([ "$label" = unit ] && echo unit || echo rest).log" 2>&1
   done
   while read -r t; do failing+=("$t"); done < <(sed -n 's/.*Test *#[0-9]*: \([^ ]*\) .*\*\*\*.*/\1/p' "$work"/logs/baseline-"$name"-*.log)
