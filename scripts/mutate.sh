@@ -15,7 +15,7 @@
 # reported and not counted.
 #
 # Usage: scripts/mutate.sh [--check] [--list] [--unit-only] [--only ID[,ID...]] [--jobs N]
-#                          [--work DIR] [--tests REGEX]
+#                          [--work DIR] [--tests REGEX] [--all-killers]
 #   --check      only verify that every mutant's text occurs exactly once
 #   --list       print the mutants
 #   --unit-only  run the unit label only (quick, a lower bound of the score;
@@ -24,6 +24,8 @@
 #   --work       the scratch directory (default build/mutation), so that two
 #                runs can go side by side
 #   --tests      run only the tests whose names match REGEX
+#   --all-killers  run every test against every mutant and name all that
+#                fail (slower; shows which faults only one test catches)
 #
 # Format of the list: `id @@ file @@ original text @@ mutated text`, one per
 # line; `<NL>` stands for a line break. The original text must occur exactly
@@ -32,7 +34,7 @@ set -uo pipefail
 root=$(cd "$(dirname "$0")/.." && pwd)
 work=$root/build/mutation
 
-check_only=0 list_only=0 unit_only=0 only="" jobs=2 tests=""
+check_only=0 list_only=0 unit_only=0 only="" jobs=2 tests="" all_killers=0
 while [ $# -gt 0 ]; do
   case $1 in
     --check) check_only=1 ;;
@@ -42,7 +44,8 @@ while [ $# -gt 0 ]; do
     --jobs) jobs=$2; shift ;;
     --work) work=$(realpath -m "$2"); shift ;;
     --tests) tests=$2; shift ;;
-    *) echo "usage: $0 [--check] [--list] [--unit-only] [--only ID[,ID...]] [--jobs N] [--work DIR] [--tests REGEX]" >&2; exit 2 ;;
+    --all-killers) all_killers=1 ;;
+    *) echo "usage: $0 [--check] [--list] [--unit-only] [--only ID[,ID...]] [--jobs N] [--work DIR] [--tests REGEX] [--all-killers]" >&2; exit 2 ;;
   esac
   shift
 done
@@ -265,22 +268,25 @@ stages=(unit 'rt|integration|kext')
 stages_of() { case $1 in "$work/build-i686") echo kext ;; *) echo "${stages[@]}" ;; esac; }
 stage_timeout() { [ "$1" = unit ] && echo 240 || echo 480; }
 
-# Runs one stage; prints the first failing test (or "timeout") and returns 1
+# Runs one stage; prints the failing tests (or "timeout") and returns 1
 # when a test failed. $1 label regex, $2 log, $3 exclusion regex, $4 build.
 run_stage() {
   local label=$1 log=$2 exclude=$3 dir=$4 args=()
   [ -n "$exclude" ] && args=(-E "$exclude")
   [ -n "$tests" ] && args+=(-R "$tests")
+  [ $all_killers = 1 ] || args+=(--stop-on-failure)
+  local start
+  start=$(wc -l <"$log")
   # A mutant can turn a loop into a runaway that allocates without end: each
   # test gets 4 GB of address space, far more than any needs.
   (ulimit -v 4194304
    timeout -k 10 "$(stage_timeout "$label")" ctest --test-dir "$dir" -L "$label" -LE 'long|hostclock' \
-     --stop-on-failure --output-on-failure "${args[@]}") >>"$log" 2>&1
+     --output-on-failure "${args[@]}") >>"$log" 2>&1
   local rc=$?
   if [ $rc -eq 124 ] || [ $rc -eq 137 ]; then echo timeout; return 1; fi
   if [ $rc -ne 0 ]; then
     local t
-    t=$(sed -n 's/.*Test *#[0-9]*: \([^ ]*\) .*\*\*\*.*/\1/p' "$log" | head -1)
+    t=$(tail -n +$((start + 1)) "$log" | sed -n 's/.*Test *#[0-9]*: \([^ ]*\) .*\*\*\*.*/\1/p' | sort -u | paste -sd, -)
     echo "${t:-ctest}"; return 1
   fi
   return 0
@@ -322,8 +328,10 @@ while IFS=$'\t' read -r id file from to; do
     result=""
     for label in $(stages_of "$dir"); do
       if killer=$(run_stage "$label" "$log" "$excluded" "$dir"); then continue; fi
-      result="killed by $killer"; break
+      result="${result:+$result,}$killer"
+      [ $all_killers = 1 ] || break
     done
+    [ -z "$result" ] || result="killed by $result"
     if [ -z "$result" ]; then result="SURVIVED"; survived=$((survived + 1)); else killed=$((killed + 1)); fi
   fi
   restore
