@@ -180,6 +180,14 @@ kext.wake-wrong-id @@ source/os_extensions/nsengine/tKPusLinuxNanoSleepTimer/tKP
 i686.kext.convert-timespec-64 @@ engine/EngineConversion.cpp @@     KernelTimespec k{static_cast<long>(time->tv_sec), time->tv_nsec};<NL>    const long r = gSystemClock.convertTime(nr, fromClock, toClock, &k);<NL>    if (r == -1 && errno == EOVERFLOW) return false;<NL>    time->tv_sec = static_cast<time_t>(k.tv_sec);<NL>    time->tv_nsec = k.tv_nsec; @@     const long r = gSystemClock.convertTime(nr, fromClock, toClock, reinterpret_cast<KernelTimespec*>(time));<NL>    if (r == -1 && errno == EOVERFLOW) return false;
 # --- log engine (log/tKPLogEngine.cpp) ---
 log.adjust-not-atomic @@ log/tKPLogEngine.cpp @@ static_cast<uint32_t>(enableCount.fetch_add(delta, kRelaxed)) @@ static_cast<uint32_t>(enableCount.exchange(enableCount.load(kRelaxed) + delta, kRelaxed))
+# --- the event log (log/...) ---
+log.cursor-one-ahead @@ log/LogHandOff.h @@ uint32_t pos = published.writeIndex - 1; @@ uint32_t pos = published.writeIndex;
+log.wrap-count-ignored @@ log/LogHandOff.h @@ uint32_t remaining = published.wrapCount != 0 ? capacity : published.writeIndex; @@ uint32_t remaining = published.writeIndex;
+log.wrap-skips-slot-zero @@ log/LogHandOff.h @@ if (wraps) slot = 0; @@ if (wraps) slot = 1;
+log.check-not-verified @@ log/LogHandOff.h @@ return A::Load(entry.check, A::kRelaxed) == LogEntryCheck(out.low, out.high, out.event, out.data); @@ return true;
+log.enable-not-nesting @@ log/tKPLogEngine.cpp @@ enabled.store(static_cast<int32_t>(count) > 0 ? enableValue.load(kRelaxed) : 0, kRelaxed); @@ enabled.store(delta > 0 ? enableValue.load(kRelaxed) : 0, kRelaxed);
+log.merge-tie-higher-cpu @@ log/LogMerge.h @@ (stored == key && losers[index] < who) @@ (stored == key && losers[index] > who)
+log.far-past-selected @@ log/LogMerge.h @@ leaf.key = key > OrderKey(0) ? key : kLogNoHead; @@ leaf.key = key != OrderKey(0) ? key : kLogNoHead;
 EOF
 }
 
