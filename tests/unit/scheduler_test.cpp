@@ -1,453 +1,417 @@
-// The tick scheduler driven deterministically: tick passes at chosen times,
-// a fake timer that records its arming, callbacks that record their calls.
+// The tick scheduler driven deterministically: passes at chosen times, a fake timer, recording callbacks.
 #include <gtest/gtest.h>
+#include <time.h>
 
+#include <atomic>
+#include <tuple>
 #include <vector>
 
 #include "SchedulerHarness.h"
-#include "engine/LibraryFrame.h"
-#include "engine/SchedulerState.h"
-#include "engine/TickService.h"
-#include "engine/tKPusTimingEngine.h"
-#include "engine/WaitList.h"
+#include "engine/SystemClock.h"
 #include "quelta/quelta.h"
 
 using namespace quelta;
-using testsupport::SchedulerHarness;
 
 namespace {
 
-constexpr uint64_t kMs = 1000000;
+constexpr uint64_t kMs = 1000000, kSecond = 1000 * kMs;
+using Nodes = std::vector<WaitNode*>;
+using Tags = std::vector<int>;
+uint32_t State(const WaitNode* n) { return n->state.load(); }
+uint32_t Fired(const WaitNode* n) { return n->fireCount.load(); }
+constexpr uint32_t kFree = uint32_t(NodeState::kFree), kHeld = uint32_t(NodeState::kHeld), kDone = uint32_t(NodeState::kFired);
 
 std::vector<uint64_t> gTicks;
 void RecordTick(uint64_t serial) { gTicks.push_back(serial); }
+struct Call { void* arg; uint64_t seen; };  // seen: the ClockTime behind arg
+std::vector<Call> gCalls;
+void RecordCallback(void* arg) { gCalls.push_back({arg, ToU64(*static_cast<ClockTime*>(arg))}); }
+Tags gFired;
+uint32_t gRelease = 0;  // what the wait callback asks for
+uint32_t RecordFire(void* arg) { return gFired.push_back(int(reinterpret_cast<intptr_t>(arg))), gRelease; }
+std::atomic<int> gClockReads{0};
+int CountingGetTime(clockid_t id, timespec* ts) { return gClockReads.fetch_add(1), clock_gettime(id, ts); }
 
-struct CallbackCall {
-    void* arg;
-    uint64_t nowSeen;  // the ClockTime behind arg when arg is the pass's now
-};
-std::vector<CallbackCall> gCalls;
-void RecordCallback(void* arg) {
-    gCalls.push_back({arg, ToU64(*static_cast<ClockTime*>(arg))});
-}
-
-std::vector<int> gFired;
-uint32_t gReleaseDecision = 0;
-uint32_t RecordFire(void* arg) {
-    gFired.push_back(static_cast<int>(reinterpret_cast<intptr_t>(arg)));
-    return gReleaseDecision;
-}
-
-class SchedulerTest : public ::testing::Test {
+class Scheduler : public ::testing::Test {
 protected:
-    void SetUp() override {
-        gTicks.clear();
-        gCalls.clear();
-        gFired.clear();
-        gReleaseDecision = 0;
+    void SetUp() override { gTicks.clear(), gCalls.clear(), gFired.clear(), gRelease = 0; }
+    void TearDown() override { ResetSystemClockHooks(); }
+    // Queues `n` at `deadline`; `tag` is what RecordFire records when it fires.
+    uint32_t Queue(WaitNode* n, uint64_t deadline, int tag = 0, QueltaWaitCallbackFn cb = RecordFire) {
+        const ClockTime d = FromU64(deadline);
+        return InsertWaitNode(n, &d, cb, reinterpret_cast<void*>(intptr_t(tag)));
     }
-    uint32_t Queue(WaitNode* node, uint64_t deadline, int tag, QueltaWaitCallbackFn cb = RecordFire) {
-        ClockTime d = FromU64(deadline);
-        return InsertWaitNode(node, &d, cb, reinterpret_cast<void*>(static_cast<intptr_t>(tag)));
+    // Released as it fires; its waiter wakes by itself at `selfWake` (0: never).
+    WaitNode* QueueAt(uint64_t deadline, bool global, uint64_t selfWake = 0) {
+        WaitNode* n = h.Take(global, 1, 0, selfWake);
+        EXPECT_EQ(Queue(n, deadline, 0, nullptr), 0u);
+        return n;
     }
-    // The controlled clock at `now`, the next tick one period ahead.
-    void MoveTo(uint64_t now) {
-        h.SetNow(now);
-        gNextTick.Store(now + kMs);
-        gNextDeadline.Store(now + kMs);
-    }
-    std::vector<WaitNode*> ListOrder() {
-        std::vector<WaitNode*> out;
-        for (WaitNode* n = gWaitList.load(); n != nullptr; n = n->next.load()) out.push_back(n);
-        return out;
-    }
-    SchedulerHarness h;
+    void PassAt(uint64_t t) { h.SetNow(t), h.Pass(); }
+    void Tick() { PassAt(gNextTick.Load()); }
+    void MoveTo(uint64_t now) { h.SetNow(now), gNextTick.Store(now + kMs), gNextDeadline.Store(now + kMs); }
+    uint32_t SetCallbackTime(uint64_t t, int32_t clock) { const ClockTime c = FromU64(t); return quelta_iTSC_SetCallbackTime(&c, clock); }
+    void SetOffset(int32_t seconds) { gEngine.load()->SetEpochOffset(seconds); }
+    testsupport::SchedulerHarness h;
 };
 
-TEST_F(SchedulerTest, TickAtItsTimeHasZeroJitterAndKeepsTheGrid) {
+// Ticks on time: zero jitter, one period apart; a late one served once, not replayed, the grid restarted
+// from it; the tick serial counts only while a tick callback is registered.
+TEST_F(Scheduler, TicksKeepTheGridAndAreNeverReplayed) {
     auto* engine = gEngine.load();
-    engine->statsCount.store(0);
+    engine->statsCount.store(0), engine->statsEnabled.store(1);
+    for (int i = 0; i < 500; ++i) Tick();
+    EXPECT_EQ(std::tuple(engine->statsCount.load(), engine->stats.jitterSamples[0].load()), std::tuple(500, 0u));
+    EXPECT_EQ(std::tuple(gNextTick.Load(), h.timer->LastArmed()), std::tuple(h.Now() + kMs, h.Now() + kMs));
+    gTickCallback.store(RecordTick);
+    const uint64_t late = gNextTick.Load() + 3 * kMs + kMs / 2;
+    PassAt(late);
+    EXPECT_EQ(std::tuple(gNextTick.Load(), h.timer->LastArmed()), std::tuple(late, late));  // next tick at once
+    PassAt(late + 1000);
+    EXPECT_EQ(gNextTick.Load(), late + kMs);
+    PassAt(late + kMs / 2);  // no tick due
+    EXPECT_EQ(gTicks, (std::vector<uint64_t>{0, 1}));
+}
+
+// The jitter samples fill an array of 1000; a count at its end or below 0 records nothing, nor beside it.
+TEST_F(Scheduler, JitterSamplesStayInsideTheirArray) {
+    auto* engine = gEngine.load();
+    engine->stats.globalReadExtra.store(0x5A5A5A5Au), engine->stats.rawReadSamples[0].store(0xA5A5A5A5u);
     engine->statsEnabled.store(1);
-    h.SetNow(gNextTick.Load());
-    h.Pass();
-    EXPECT_EQ(engine->statsCount.load(), 1);
-    EXPECT_EQ(engine->stats.jitterSamples[0].load(), 0u);
-    EXPECT_EQ(gNextTick.Load(), h.Now() + kMs);
-    EXPECT_EQ(h.timer->LastArmed(), h.Now() + kMs);
-}
-
-TEST_F(SchedulerTest, LatePassServesOneTickThenRestartsTheGrid) {
-    gTickCallback.store(RecordTick);
-    const uint64_t late = gNextTick.Load() + 3 * kMs + kMs / 2;  // 3.5 periods late
-    h.SetNow(late);
-    h.Pass();
-    EXPECT_EQ(gNextTick.Load(), late);        // missed ticks are not replayed
-    EXPECT_EQ(h.timer->LastArmed(), late);    // next tick due at once
-    h.SetNow(late + 1000);
-    h.Pass();
-    EXPECT_EQ(gNextTick.Load(), late + kMs);  // one period past the served tick
-    EXPECT_EQ(gTicks, (std::vector<uint64_t>{0, 1}));  // two calls, not four
-}
-
-TEST_F(SchedulerTest, TickSerialCountsOnlyWhileRegistered) {
-    for (int i = 0; i < 500; ++i) {
-        h.SetNow(gNextTick.Load());
-        h.Pass();
+    for (int32_t count : {999, 1000, -1}) {
+        engine->statsCount.store(count);
+        PassAt(gNextTick.Load() + 123);
+        EXPECT_EQ(engine->statsCount.load(), count == 999 ? 1000 : count);
     }
-    gTickCallback.store(RecordTick);
-    h.SetNow(gNextTick.Load());
-    h.Pass();
-    h.SetNow(h.Now() + kMs / 2);  // no tick due on this pass
-    h.Pass();
-    EXPECT_EQ(gTicks, (std::vector<uint64_t>{0}));
+    EXPECT_EQ(engine->stats.jitterSamples[999].load(), 123u);
+    EXPECT_EQ(std::tuple(engine->stats.rawReadSamples[0].load(), engine->stats.globalReadExtra.load()),
+              std::tuple(0xA5A5A5A5u, 0x5A5A5A5Au));
 }
 
-// Both callback times due in one pass, each exactly at the pass's time (a
-// time equal to now is due): the callback is called twice. (The two calls
-// carry the same function, argument and now, so which comes first cannot be
-// told from outside.)
-TEST_F(SchedulerTest, BothCallbackTimesDueInOnePassCallTwice) {
+// Both callback times due exactly at a pass: two calls, given the pass's now (no argument set).
+TEST_F(Scheduler, BothCallbackTimesDueInOnePassCallTwice) {
     quelta_iTSC_SetCallback(RecordCallback, nullptr);
-    ClockTime t = FromU64(h.Now() + 100);
-    ASSERT_EQ(quelta_iTSC_SetCallbackTime(&t, 0), 1u);
-    ASSERT_EQ(quelta_iTSC_SetCallbackTime(&t, -1), 1u);  // global == monotonic here
-    EXPECT_EQ(h.timer->LastArmed(), ToU64(t));           // earlier than the tick: armed
-    h.SetNow(ToU64(t));
-    h.Pass();
+    const uint64_t t = h.Now() + 100;
+    EXPECT_EQ(SetCallbackTime(t, 0) + SetCallbackTime(t, -1), 2u);
+    EXPECT_EQ(h.timer->LastArmed(), t);  // earlier than the tick: armed
+    PassAt(t);
     ASSERT_EQ(gCalls.size(), 2u);
-    // With no argument set, the callback receives the pass's own `now`.
-    EXPECT_EQ(gCalls[0].nowSeen, h.Now());
-    EXPECT_EQ(gCalls[1].nowSeen, h.Now());
-    EXPECT_TRUE(IsNever(gMonotonicCallbackTime.Load()));
-    EXPECT_TRUE(IsNever(gGlobalCallbackTime.Load()));
+    EXPECT_EQ(std::tuple(gCalls[0].seen, gCalls[1].seen), std::tuple(t, t));
+    EXPECT_TRUE(IsNever(gMonotonicCallbackTime.Load()) && IsNever(gGlobalCallbackTime.Load()));
 }
 
-// A callback time between ticks, several ticks ahead, is stored without
-// arming; each pass folds it into the next deadline, so the pass before it
-// arms the timer for the time itself, not for the tick after it. `clock` 0 is
-// the monotonic callback time, -1 the global one (global == monotonic here).
-void ExpectFoldedAndArmedExactly(SchedulerHarness& h, int32_t clock) {
-    SCOPED_TRACE(clock == 0 ? "monotonic callback time" : "global callback time");
+// A callback time ticks ahead is stored unarmed, then folded by each tick: the one before it arms for it.
+TEST_F(Scheduler, ALaterCallbackTimeIsFoldedAndArmedExactly) {
     quelta_iTSC_SetCallback(RecordCallback, nullptr);
-    const uint64_t when = h.Now() + 5 * kMs + 300000;  // between ticks, 5 ms ahead
-    ClockTime t = FromU64(when);
-    const size_t armedBefore = h.timer->armed.size();
-    ASSERT_EQ(quelta_iTSC_SetCallbackTime(&t, clock), 1u);
-    EXPECT_EQ(h.timer->armed.size(), armedBefore);  // stored without arming
-    // Ticks until the pass before it: that pass arms for the callback time itself.
-    while (gNextTick.Load() + kMs <= when) {
-        h.SetNow(gNextTick.Load());
-        h.Pass();
+    for (int32_t clock : {0, -1}) {
+        gCalls.clear();
+        const uint64_t when = h.Now() + 5 * kMs + 300000;
+        const size_t armed = h.timer->armed.size();
+        SetCallbackTime(when, clock);
+        EXPECT_EQ(h.timer->armed.size(), armed) << clock;
+        while (gNextTick.Load() + kMs <= when) Tick();
+        Tick();
+        EXPECT_EQ(h.timer->LastArmed(), when) << clock;
+        EXPECT_TRUE(gCalls.empty());
+        PassAt(when);
+        EXPECT_EQ(gCalls.size(), 1u) << clock;
     }
-    h.SetNow(gNextTick.Load());
-    h.Pass();
-    EXPECT_EQ(h.timer->LastArmed(), when);
-    EXPECT_TRUE(gCalls.empty());
-    h.SetNow(when);
-    h.Pass();
-    EXPECT_EQ(gCalls.size(), 1u);
-}
-
-TEST_F(SchedulerTest, MonotonicCallbackTimeLaterThanTheTickIsFoldedAndArmedExactly) {
-    ExpectFoldedAndArmedExactly(h, 0);
-}
-
-TEST_F(SchedulerTest, GlobalCallbackTimeLaterThanTheTickIsFoldedAndArmedExactly) {
-    ExpectFoldedAndArmedExactly(h, -1);
 }
 
 void ReArmingCallback(void* arg) {
     gCalls.push_back({arg, 0});
-    if (gCalls.size() < 3) {
-        ClockTime next = FromU64(ToU64(*static_cast<ClockTime*>(arg)) + 250000);
-        quelta_iTSC_SetCallbackTime(&next, 0);
-    }
+    const ClockTime next = FromU64(ToU64(*static_cast<ClockTime*>(arg)) + 250000);
+    if (gCalls.size() < 3) quelta_iTSC_SetCallbackTime(&next, 0);
 }
 
-TEST_F(SchedulerTest, CallbackSettingItsNextTimeIsArmedAtOnce) {
+TEST_F(Scheduler, ACallbackSettingItsNextTimeIsArmedAtOnce) {
     quelta_iTSC_SetCallback(ReArmingCallback, nullptr);
-    ClockTime t = FromU64(h.Now() + 100000);
-    quelta_iTSC_SetCallbackTime(&t, 0);
-    h.SetNow(h.Now() + 100000);
-    h.Pass();
+    SetCallbackTime(h.Now() + 100000, 0);
+    PassAt(h.Now() + 100000);
     EXPECT_EQ(gCalls.size(), 1u);
-    EXPECT_EQ(ToU64(gMonotonicCallbackTime.LoadTime()), h.Now() + 250000);
+    EXPECT_EQ(gMonotonicCallbackTime.Load(), h.Now() + 250000);
     EXPECT_EQ(h.timer->LastArmed(), h.Now() + 250000);  // the pass kept the earlier time
-    h.SetNow(h.Now() + 250000);
-    h.Pass();
+    PassAt(h.Now() + 250000);
     EXPECT_EQ(gCalls.size(), 2u);
 }
 
-void RecordArgument(void* arg) { gCalls.push_back({arg, 0}); }
-
-TEST_F(SchedulerTest, CallbackArgumentAndNeverTimeCancel) {
-    int token = 0;
-    quelta_iTSC_SetCallback(RecordArgument, &token);
-    ClockTime t = FromU64(h.Now() + 10);
-    quelta_iTSC_SetCallbackTime(&t, 0);
-    ClockTime never = kNeverTime;
-    EXPECT_EQ(quelta_iTSC_SetCallbackTime(&never, 0), 1u);  // cancels
-    h.SetNow(h.Now() + 100);
-    h.Pass();
+// NeverTime cancels a callback time; a set argument is what the callback gets.
+TEST_F(Scheduler, CallbackArgumentAndNeverTimeCancel) {
+    ClockTime token{42, 0};
+    quelta_iTSC_SetCallback(RecordCallback, &token);
+    SetCallbackTime(h.Now() + 10, 0);
+    EXPECT_EQ(SetCallbackTime(kNeverTime64, 0), 1u);
+    PassAt(h.Now() + 100);
     EXPECT_TRUE(gCalls.empty());
-    quelta_iTSC_SetCallbackTime(&t, 0);
+    SetCallbackTime(h.Now() - 90, 0);
     h.Pass();
     ASSERT_EQ(gCalls.size(), 1u);
-    EXPECT_EQ(gCalls[0].arg, &token);
+    EXPECT_EQ(std::tuple(gCalls[0].arg, gCalls[0].seen), std::tuple((void*)&token, 42ull));
 }
 
-TEST_F(SchedulerTest, CallbackTimeWithoutTimerIsRefusedOnlyWhenItWouldArm) {
-    h.RemoveTimer();
-    const uint64_t deadlineBefore = gNextDeadline.Load();
-    ClockTime early = FromU64(h.Now() + 10);
-    EXPECT_EQ(quelta_iTSC_SetCallbackTime(&early, 0), 0u);
-    EXPECT_TRUE(IsNever(gMonotonicCallbackTime.Load()));
-    EXPECT_EQ(gNextDeadline.Load(), deadlineBefore);
-    ClockTime late = FromU64(h.Now() + 50 * kMs);
-    EXPECT_EQ(quelta_iTSC_SetCallbackTime(&late, 0), 1u);
-    EXPECT_EQ(gMonotonicCallbackTime.Load(), ToU64(late));
-}
-
-// Three equal deadlines queued into an empty list, one earlier and one later:
-// a pass exactly at the equal deadline finds them due (a deadline equal to
-// now is due) and fires them in list order, the equal ones in the order they
-// arrived; the later one stays and is folded into the arming.
-TEST_F(SchedulerTest, ExpiredNodesFireInListOrderAndTheNextIsFolded) {
-    const uint64_t now = h.Now();
-    WaitNode* x = h.Take();
-    WaitNode* y = h.Take();
-    WaitNode* z = h.Take();
-    WaitNode* a = h.Take();
-    WaitNode* d = h.Take();
-    ASSERT_EQ(Queue(x, now + 300, 1), 0u);
-    ASSERT_EQ(Queue(y, now + 300, 2), 0u);
-    ASSERT_EQ(Queue(z, now + 300, 3), 0u);
-    ASSERT_EQ(Queue(a, now + 100, 4), 0u);
-    ASSERT_EQ(Queue(d, now + 600000, 5), 0u);
-    EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{a, x, y, z, d}));
-    h.SetNow(now + 300);
-    h.Pass();
-    EXPECT_EQ(gFired, (std::vector<int>{4, 1, 2, 3}));
-    EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{d}));
-    EXPECT_EQ(h.timer->LastArmed(), now + 600000);  // earlier than the next tick
-    for (WaitNode* n : {x, y, z, a}) {
-        EXPECT_EQ(n->fireCount.load(), 1u);
-        EXPECT_EQ(n->state.load(), static_cast<uint32_t>(NodeState::kFired));
-        ReleaseWaitNode(n);
-    }
-    ReleaseWaitNode(d);  // cancels the queued wait
-    uint32_t freeCount = 0;
-    EXPECT_TRUE(AuditWaitNodes(&freeCount, nullptr, nullptr));
-    EXPECT_EQ(freeCount, kWaitNodeCount);
-}
-
-TEST_F(SchedulerTest, ReleaseDecisionComesFromTheCallbackOrAutoRelease) {
-    const uint64_t now = h.Now();
-    WaitNode* keep = h.Take();
-    WaitNode* back = h.Take();
-    WaitNode* plain = h.Take();
-    keep->autoRelease.store(0);
-    back->autoRelease.store(0);
-    plain->autoRelease.store(1);
-    Queue(keep, now + 1, 1);
-    gReleaseDecision = 0;
-    h.SetNow(now + 2);
-    h.Pass();
-    gReleaseDecision = 1;
-    Queue(back, now + 3, 2);
-    Queue(plain, now + 3, 3, nullptr);
-    h.SetNow(now + 4);
-    h.Pass();
-    EXPECT_EQ(keep->state.load(), static_cast<uint32_t>(NodeState::kFired));
-    EXPECT_EQ(back->state.load(), static_cast<uint32_t>(NodeState::kFree));
-    EXPECT_EQ(plain->state.load(), static_cast<uint32_t>(NodeState::kFree));
-    ReleaseWaitNode(keep);
-    uint32_t freeCount = 0, queued = 0, held = 0;
-    EXPECT_TRUE(AuditWaitNodes(&freeCount, &queued, &held));
-    EXPECT_EQ(freeCount, kWaitNodeCount);
-}
-
-TEST_F(SchedulerTest, InsertArmsOnlyForANewEarliestDeadline) {
-    const uint64_t now = h.Now();
-    const size_t armed0 = h.timer->armed.size();
-    WaitNode* late = h.Take();
-    Queue(late, now + 5 * kMs, 1);  // later than the next tick: no arming
-    EXPECT_EQ(h.timer->armed.size(), armed0);
-    WaitNode* early = h.Take();
-    Queue(early, now + 200000, 2);
-    EXPECT_EQ(h.timer->LastArmed(), now + 200000);
-    EXPECT_EQ(gNextDeadline.Load(), now + 200000);
-    WaitNode* never = h.Take();
-    ClockTime n = kNeverTime;
-    InsertWaitNode(never, &n, nullptr, nullptr);
-    WaitNode* first = h.Take();
-    Queue(first, 0xFFFFFFFF00000000ull, 3);  // high word 0xFFFFFFFF: before every time
-    EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{first, early, late, never}));
-    // Armed as already past, not for a time decades ahead.
-    EXPECT_EQ(h.timer->LastArmed(), 0u);
-    EXPECT_EQ(h.timer->expireNowCalls, 0);
-    h.Pass();  // fires at the next pass
-    EXPECT_EQ(gFired, (std::vector<int>{3}));
-}
-
-TEST_F(SchedulerTest, InsertWithoutTimerIsRefusedAndLeavesTheListAlone) {
-    const uint64_t now = h.Now();
-    WaitNode* queued = h.Take();
-    Queue(queued, now + 500000, 1);
-    h.RemoveTimer();
-    WaitNode* held = h.Take();
-    held->autoRelease.store(0);
-    EXPECT_EQ(Queue(held, now + 100, 2), 1u);
-    EXPECT_EQ(held->state.load(), static_cast<uint32_t>(NodeState::kHeld));
-    WaitNode* autoNode = h.Take();
-    autoNode->autoRelease.store(1);
-    EXPECT_EQ(Queue(autoNode, now + 100, 3), 1u);
-    EXPECT_EQ(gFreeList.load(), autoNode);  // straight back to the pool
-    WaitNode* behind = h.Take();  // would not be the earliest: refused all the same
-    behind->autoRelease.store(0);
-    EXPECT_EQ(Queue(behind, now + 900000, 4), 1u);
-    EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{queued}));
-    ReleaseWaitNode(behind);
-    ReleaseWaitNode(held);
-    ReleaseWaitNode(queued);
-    uint32_t freeCount = 0;
-    EXPECT_TRUE(AuditWaitNodes(&freeCount, nullptr, nullptr));
-    EXPECT_EQ(freeCount, kWaitNodeCount);
-}
-
-TEST_F(SchedulerTest, BadReleasesAreRefusedWithoutCorruptingTheLists) {
-    WaitNode* fresh = gFreeList.load();
-    ReleaseWaitNode(fresh);  // never taken: nothing happens
-    WaitNode* n = h.Take();
-    ReleaseWaitNode(n);
-    ReleaseWaitNode(n);  // twice: refused
-    WaitNode foreign{};
-    ReleaseWaitNode(&foreign);
-    ReleaseWaitNode(reinterpret_cast<WaitNode*>(reinterpret_cast<char*>(n) + 4));
-    uint32_t freeCount = 0;
-    EXPECT_TRUE(AuditWaitNodes(&freeCount, nullptr, nullptr));
-    EXPECT_EQ(freeCount, kWaitNodeCount);
-}
-
-TEST_F(SchedulerTest, PoolExhaustionAndUnstartedSystemRefuse) {
-    std::vector<WaitNode*> taken;
-    while (WaitNode* n = h.Take()) taken.push_back(n);
-    EXPECT_EQ(taken.size(), kWaitNodeCount);
-    ClockTime d = FromU64(h.Now() + kMs);
-    EXPECT_EQ(quelta_iTSCEvent_Wait_Callback_C(nullptr, &d, RecordFire, nullptr, 0, nullptr), 3u);
-    for (WaitNode* n : taken) ReleaseWaitNode(n);
-    gEventSystemReady.store(0);
-    EXPECT_EQ(quelta_iTSCEvent_Wait_Callback_C(nullptr, &d, RecordFire, nullptr, 0, nullptr), 3u);
-    gEventSystemReady.store(1);
-}
-
-TEST_F(SchedulerTest, TickCallbackRegistrationAndControlFlag) {
-    iKPusTimingEngine* e = gEngine.load();
-    e->RegisterTickCallback(RecordTick);
-    EXPECT_EQ(gTickCallback.load(), &RecordTick);
-    e->UnregisterTickCallback(nullptr);  // wrong function: cleared all the same
-    EXPECT_EQ(gTickCallback.load(), nullptr);
-    e->SetControlFlag(1);
-    EXPECT_EQ(gControlFlag.load(), 1u);
-    e->SetControlFlag(3);
-    EXPECT_EQ(gControlFlag.load(), 1u);
-    e->SetControlFlag(2);
-    EXPECT_EQ(gControlFlag.load(), 0u);
-}
-
-// NeverTime is one value: a time whose low word alone is 0xFFFFFFFF, or whose
-// high word alone is 0xFFFFFFFE, is an ordinary time, armed for (not expired
-// at once) and fired like any other; so is a tick in that range.
-TEST_F(SchedulerTest, NeverTimeIsRecognisedOnlyWhenBothWordsMatch) {
-    for (uint64_t t : {0x00000005FFFFFFFFull, 0xFFFFFFFE00000005ull}) {
-        SCOPED_TRACE(t);
-        gFired.clear();
-        MoveTo(t - 400000);
-        h.Pass();
-        EXPECT_EQ(h.timer->LastArmed(), t + 600000) << "the next tick was not armed";
-        const int expiredAtOnce = h.timer->expireNowCalls;
-        WaitNode* n = h.Take();
-        ASSERT_EQ(Queue(n, t, 7), 0u);
-        EXPECT_EQ(h.timer->LastArmed(), t);
-        EXPECT_EQ(h.timer->expireNowCalls, expiredAtOnce);
-        h.SetNow(t);
-        h.Pass();
-        EXPECT_EQ(gFired, std::vector<int>{7});
-        ReleaseWaitNode(n);
-    }
-}
-
-// A NeverTime global callback time is no time: it is neither converted to
-// the monotonic clock nor folded into the next arming. With an epoch offset
-// of 100 s, NeverTime taken for a time would read as one 100 s before it on
-// the monotonic clock; the clock stands just before that here, so such a
-// time would be armed ahead of the next tick.
-TEST_F(SchedulerTest, NeverTimeGlobalCallbackTimeIsNeitherConvertedNorFolded) {
-    gEngine.load()->SetEpochOffset(100);
-    MoveTo(kNeverTime64 - 100 * 1000 * kMs - 400000);
+// A NeverTime global callback time is neither converted (at +100 s it would arm early) nor folded.
+TEST_F(Scheduler, NeverTimeGlobalCallbackTimeIsNeitherConvertedNorFolded) {
+    SetOffset(100);
+    MoveTo(kNeverTime64 - 100 * kSecond - 400000);
     quelta_iTSC_SetCallback(RecordCallback, nullptr);
-    const size_t armed = h.timer->armed.size();
-    const ClockTime never = kNeverTime;
-    EXPECT_EQ(quelta_iTSC_SetCallbackTime(&never, -1), 1u);
-    EXPECT_EQ(h.timer->armed.size(), armed) << "armed for a cancelled callback time";
+    EXPECT_EQ(SetCallbackTime(kNeverTime64, -1), 1u);
+    EXPECT_TRUE(h.timer->armed.empty()) << "armed for a cancelled callback time";
     EXPECT_TRUE(IsNever(gGlobalCallbackTime.Load()));
     h.Pass();
     EXPECT_EQ(h.timer->LastArmed(), h.Now() + kMs) << "a cancelled callback time was folded";
     EXPECT_TRUE(gCalls.empty());
 }
 
-// The jitter samples fill an array of 1000: the last sample goes to index
-// 999; a count at the end, or below 0, records nothing, and nothing is ever
-// written beside the array (the statistics fields just before and after it).
-TEST_F(SchedulerTest, JitterSamplesStayInsideTheirArray) {
-    auto* engine = gEngine.load();
-    engine->stats.globalReadExtra.store(0x5A5A5A5Au);
-    engine->stats.rawReadSamples[0].store(0xA5A5A5A5u);
-    engine->statsEnabled.store(1);
-    for (int32_t count : {999, 1000, -1}) {
-        engine->statsCount.store(count);
-        h.SetNow(gNextTick.Load() + 123);
-        h.Pass();
-        EXPECT_EQ(engine->statsCount.load(), count == 999 ? 1000 : count);
+TEST_F(Scheduler, TickCallbackRegistrationAndControlFlag) {
+    iKPusTimingEngine* e = gEngine.load();
+    e->RegisterTickCallback(RecordTick);
+    EXPECT_EQ(gTickCallback.load(), &RecordTick);
+    e->UnregisterTickCallback(nullptr);  // another function: cleared all the same
+    EXPECT_EQ(gTickCallback.load(), nullptr);
+    for (auto [set, flag] : {std::pair{1u, 1u}, {3u, 1u}, {2u, 0u}}) {
+        e->SetControlFlag(set);
+        EXPECT_EQ(gControlFlag.load(), flag) << set;
     }
-    EXPECT_EQ(engine->stats.jitterSamples[999].load(), 123u);
-    EXPECT_EQ(engine->stats.rawReadSamples[0].load(), 0xA5A5A5A5u);
-    EXPECT_EQ(engine->stats.globalReadExtra.load(), 0x5A5A5A5Au);
 }
 
-// A new generation of the global clock (no operation of the library makes
-// one; the test stores it) fires every abortable global-clock node at once,
-// whatever its deadline. A global node that is not abortable and an
-// abortable monotonic one stay queued. The change is seen once: a node
-// queued after it is not fired by the passes that follow.
-TEST_F(SchedulerTest, ANewGenerationFiresOnlyAbortableGlobalNodesOnce) {
-    const uint32_t saved = gGeneration.load();
-    h.Pass();  // the routine's first pass notes the generation
-    const uint64_t far = h.Now() + 3600 * 1000 * kMs;
-    auto queue = [&](uint32_t isGlobal, uint8_t abortable, int tag) {
+// A deadline equal to now is due; nodes fire in list order (equal ones as they came), the rest is folded.
+TEST_F(Scheduler, DueNodesFireInListOrderAndTheNextIsFolded) {
+    const uint64_t now = h.Now();
+    WaitNode *x = h.Take(), *y = h.Take(), *z = h.Take(), *a = h.Take(), *d = h.Take();
+    int tag = 0;
+    for (auto [n, at] : {std::pair{x, now + 300}, {y, now + 300}, {z, now + 300}, {a, now + 100}, {d, now + 600000}}) {
+        ASSERT_EQ(Queue(n, at, ++tag), 0u);
+    }
+    EXPECT_EQ(h.ListOrder(), (Nodes{a, x, y, z, d}));
+    PassAt(now + 300);
+    EXPECT_EQ(gFired, (Tags{4, 1, 2, 3}));
+    EXPECT_EQ(h.ListOrder(), Nodes{d});
+    EXPECT_EQ(h.timer->LastArmed(), now + 600000);
+    for (WaitNode* n : {x, y, z, a}) EXPECT_EQ(std::tuple(Fired(n), State(n)), std::tuple(1u, kDone));
+    for (WaitNode* n : {x, y, z, a, d}) ReleaseWaitNode(n);  // d: cancels the queued wait
+    EXPECT_EQ(h.FreeNodes(), kWaitNodeCount);
+}
+
+// Whether a fired node goes back to the pool: the callback's answer, or autoRelease without one.
+TEST_F(Scheduler, ReleaseDecisionComesFromTheCallbackOrAutoRelease) {
+    WaitNode *keep = h.Take(0, 0), *back = h.Take(0, 0), *plain = h.Take(0, 1);
+    Queue(keep, h.Now() + 1);
+    PassAt(h.Now() + 2);
+    gRelease = 1;
+    Queue(back, h.Now() + 1), Queue(plain, h.Now() + 1, 0, nullptr);
+    PassAt(h.Now() + 2);
+    EXPECT_EQ(std::tuple(State(keep), State(back), State(plain)), std::tuple(kDone, kFree, kFree));
+    ReleaseWaitNode(keep);
+    EXPECT_EQ(h.FreeNodes(), kWaitNodeCount);
+}
+
+// An insert arms only for a new earliest deadline; high word 0xFFFFFFFF is before every time: past.
+TEST_F(Scheduler, InsertArmsOnlyForANewEarliestDeadline) {
+    const uint64_t now = h.Now();
+    WaitNode *late = h.Take(), *early = h.Take(), *never = h.Take(), *first = h.Take();
+    Queue(late, now + 5 * kMs, 1);
+    EXPECT_TRUE(h.timer->armed.empty());
+    Queue(early, now + 200000, 2);
+    EXPECT_EQ(std::tuple(h.timer->LastArmed(), gNextDeadline.Load()), std::tuple(now + 200000, now + 200000));
+    Queue(never, kNeverTime64, 0, nullptr), Queue(first, 0xFFFFFFFF00000000ull, 3);
+    EXPECT_EQ(h.ListOrder(), (Nodes{first, early, late, never}));
+    EXPECT_EQ(std::tuple(h.timer->LastArmed(), h.timer->expireNowCalls), std::tuple(0ull, 0));
+    h.Pass();
+    EXPECT_EQ(gFired, Tags{3});
+}
+
+// Without a timer a callback time that would arm is refused (0), and so is every insert (1), earliest
+// or not: the node stays held, or goes back to the pool with autoRelease; the list is left alone.
+TEST_F(Scheduler, WithoutATimerWhatWouldNeedItIsRefused) {
+    WaitNode *queued = h.Take(), *held = h.Take(0, 0), *autoNode = h.Take(0, 1), *behind = h.Take(0, 0);
+    Queue(queued, h.Now() + 500000);
+    h.RemoveTimer();
+    const uint64_t deadline = gNextDeadline.Load();
+    EXPECT_EQ(SetCallbackTime(h.Now() + 10, 0), 0u);
+    EXPECT_TRUE(IsNever(gMonotonicCallbackTime.Load()));
+    EXPECT_EQ(gNextDeadline.Load(), deadline);
+    EXPECT_EQ(SetCallbackTime(h.Now() + 50 * kMs, 0), 1u);
+    EXPECT_EQ(gMonotonicCallbackTime.Load(), h.Now() + 50 * kMs);
+    EXPECT_EQ(Queue(held, h.Now() + 100), 1u);
+    EXPECT_EQ(State(held), kHeld);
+    EXPECT_EQ(Queue(autoNode, h.Now() + 100), 1u);
+    EXPECT_EQ(gFreeList.load(), autoNode);
+    EXPECT_EQ(Queue(behind, h.Now() + 900000), 1u);
+    EXPECT_EQ(h.ListOrder(), Nodes{queued});
+    for (WaitNode* n : {behind, held, queued}) ReleaseWaitNode(n);
+    EXPECT_EQ(h.FreeNodes(), kWaitNodeCount);
+}
+
+TEST_F(Scheduler, BadReleasesAreRefusedWithoutCorruptingTheLists) {
+    WaitNode foreign{};
+    WaitNode *unused = gFreeList.load(), *n = h.Take();
+    for (WaitNode* bad : {unused, n, n, &foreign, reinterpret_cast<WaitNode*>(reinterpret_cast<char*>(n) + 4)}) {
+        ReleaseWaitNode(bad);  // never taken, twice, not of the pool, inside a node
+    }
+    EXPECT_EQ(h.FreeNodes(), kWaitNodeCount);
+}
+
+// NeverTime is one value: a time with only one of its words is an ordinary time; so is a tick there.
+TEST_F(Scheduler, NeverTimeIsRecognisedOnlyWhenBothWordsMatch) {
+    for (uint64_t t : {0x00000005FFFFFFFFull, 0xFFFFFFFE00000005ull}) {
+        gFired.clear();
+        MoveTo(t - 400000);
+        h.Pass();
+        EXPECT_EQ(h.timer->LastArmed(), t + 600000) << t << ": the next tick was not armed";
         WaitNode* n = h.Take();
-        n->isGlobal.store(isGlobal);
-        n->abortable.store(abortable);
-        EXPECT_EQ(Queue(n, far, tag), 0u);
-        return n;
-    };
-    WaitNode* aborted = queue(1, 1, 1);
-    WaitNode* global = queue(1, 0, 2);
-    WaitNode* monotonic = queue(0, 1, 3);
+        ASSERT_EQ(Queue(n, t, 7), 0u);
+        EXPECT_EQ(std::tuple(h.timer->LastArmed(), h.timer->expireNowCalls), std::tuple(t, 0));
+        PassAt(t);
+        EXPECT_EQ(gFired, Tags{7}) << t;
+        ReleaseWaitNode(n);
+    }
+}
+
+// A new generation of the global clock fires abortable global nodes (only) at once, and only once.
+TEST_F(Scheduler, ANewGenerationFiresOnlyAbortableGlobalNodesOnce) {
+    const uint32_t saved = gGeneration.load();
+    h.Pass();  // the first pass notes the generation
+    const uint64_t far = h.Now() + 3600 * kSecond;
+    WaitNode *aborted = h.Take(1, 1, 1), *global = h.Take(1, 1, 0), *monotonic = h.Take(0, 1, 1), *later = h.Take(1, 1, 1);
+    Queue(aborted, far, 1), Queue(global, far, 2), Queue(monotonic, far, 3);
     gGeneration.store(saved + 1);
-    h.SetNow(h.Now() + 1000);
-    h.Pass();
-    EXPECT_EQ(gFired, std::vector<int>{1});
-    WaitNode* later = queue(1, 1, 4);
-    h.SetNow(h.Now() + 1000);
-    h.Pass();
-    EXPECT_EQ(gFired, std::vector<int>{1}) << "an old change of generation fired a new wait";
-    EXPECT_EQ(ListOrder(), (std::vector<WaitNode*>{global, monotonic, later}));
+    PassAt(h.Now() + 1000);
+    EXPECT_EQ(gFired, Tags{1});
+    Queue(later, far, 4);
+    PassAt(h.Now() + 1000);
+    EXPECT_EQ(gFired, Tags{1}) << "an old change of generation fired a new wait";
+    EXPECT_EQ(h.ListOrder(), (Nodes{global, monotonic, later}));
     for (WaitNode* n : {aborted, global, monotonic, later}) ReleaseWaitNode(n);
     gGeneration.store(saved);
-    uint32_t freeCount = 0;
-    EXPECT_TRUE(AuditWaitNodes(&freeCount, nullptr, nullptr));
-    EXPECT_EQ(freeCount, kWaitNodeCount);
+    EXPECT_EQ(h.FreeNodes(), kWaitNodeCount);
+}
+
+// A global node queued as a pass at rest begins (reading the clock) is converted by it and fires.
+TEST_F(Scheduler, AGlobalNodeQueuedAsAPassAtRestBeginsIsConverted) {
+    SetOffset(100);
+    static decltype(this) self;
+    static WaitNode* arrived;
+    self = this, arrived = nullptr;
+    gTickNowOverride = [] {
+        if (arrived == nullptr) arrived = self->QueueAt(self->h.Now() + 100 * kSecond - kMs, true);
+        return self->h.Now();
+    };
+    h.Pass();
+    ASSERT_NE(arrived, nullptr);
+    EXPECT_EQ(Fired(arrived), 1u);
+}
+
+// Global = monotonic + 100 s: deadlines before the monotonic zero (50 s) or the global one are past.
+TEST_F(Scheduler, AGlobalDeadlineBeforeTheMonotonicZeroIsPast) {
+    SetOffset(100);
+    for (uint64_t at : {50 * kSecond, uint64_t(0xFFFFFFFF00000005ull), 200 * kSecond}) QueueAt(at, true);
+    EXPECT_EQ(h.timer->LastArmed(), 0u) << "a past deadline arms the timer at once";
+    h.Pass();
+    EXPECT_EQ(h.ListOrder().size(), 1u) << "a past deadline was not fired";
+    EXPECT_EQ(gNextDeadline.Load(), h.Now() + kMs) << "the later node is folded, the tick comes first";
+}
+
+// Global = monotonic - 100 s: a deadline < 100 s below NeverTime is the latest time, not wrapped.
+TEST_F(Scheduler, AGlobalDeadlineBeyondTheMonotonicRangeIsTheLatest) {
+    SetOffset(-100);
+    QueueAt(kNeverTime64 - 100 * kSecond + 6, true);
+    EXPECT_TRUE(h.timer->armed.empty()) << "a deadline centuries ahead was armed";
+    h.Pass();
+    EXPECT_EQ(h.ListOrder().size(), 1u) << "a deadline at the top of the range was fired";
+}
+
+// With the user-space conversion (it reads the clocks), no insert or pass converts node by node.
+TEST_F(Scheduler, InsertAndPassDoNotConvertNodeByNode) {
+    gConvertStandInEnabled.store(true);
+    const uint64_t base = ToU64(gEngine.load()->MonotonicToGlobal(FromU64(h.Now()))) + 30 * kSecond;
+    for (uint32_t i = 1; i < kWaitNodeCount; ++i) QueueAt(base + i * kMs, true);
+    gSystemClock.getTime = &CountingGetTime;
+    gClockReads.store(0);
+    QueueAt(base + kSecond, true);  // walks past every node
+    // An offset costs a read and up to three brackets of three (more under instrumentation).
+    EXPECT_LE(gClockReads.exchange(0), 16) << "an insert converts every node it passes";
+    h.Pass();
+    EXPECT_LE(gClockReads.load(), 40) << "a pass converts node by node";
+    const Nodes order = h.ListOrder();
+    ASSERT_EQ(order.size(), kWaitNodeCount) << "nodes 30 s ahead were fired";
+    EXPECT_EQ(order.back()->deadline.load(), base + kSecond);
+}
+
+// A global waiter that wakes by itself costs the timer nothing (no arming, no post),
+// unless a wall clock step puts its deadline well before that wake.
+TEST_F(Scheduler, AWaiterThatWakesByItselfCostsTheTimerThreadNothing) {
+    ASSERT_EQ(PalInitialize(), 1u);
+    PalSemaphore* semaphore = nullptr;
+    ASSERT_EQ(PalSemaphoreCreate(&semaphore), 0);
+    const uint64_t tick = gNextDeadline.Load();
+    auto queue = [&](uint64_t at) {
+        WaitNode* n = h.Take(1, 0, 0, at);
+        n->semaphore.store(semaphore);
+        EXPECT_EQ(Queue(n, at, 0, nullptr), 0u);
+        return n;
+    };
+    WaitNode* n = queue(h.Now() + 400000);
+    EXPECT_EQ(h.timer->LastArmed(), kNeverTime64) << "armed for a waiter that wakes by itself";
+    PassAt(h.Now() + 100000);
+    EXPECT_EQ(h.timer->LastArmed(), tick) << "a pass armed for it rather than for the tick";
+    PassAt(h.Now() + 400000);
+    EXPECT_NE(Fired(n), 0u);
+    EXPECT_EQ(PalSemaphoreWait(semaphore, 0), 1u) << "posted a waiter that was waking anyway";
+    ReleaseWaitNode(n);
+    n = queue(h.Now() + 400000);
+    SetOffset(1);  // the deadline is now 0.6 s past
+    PassAt(h.Now() + 1000);
+    EXPECT_NE(Fired(n), 0u) << "a stepped deadline waited for the waiter's own wake";
+    EXPECT_EQ(PalSemaphoreWait(semaphore, 0), 0u) << "the waiter was not woken";
+    ReleaseWaitNode(n);
+    PalSemaphoreDestroy(semaphore);
+}
+
+// A node that needs the timer is armed for even behind a head that wakes by itself.
+TEST_F(Scheduler, ANodeBehindASelfWakingHeadIsArmedFor) {
+    WaitNode* head = QueueAt(h.Now() + 400000, true, h.Now() + 400000);
+    ASSERT_EQ(h.timer->LastArmed(), kNeverTime64);
+    QueueAt(h.Now() + 600000, false);
+    ASSERT_EQ(gWaitList.load(), head);
+    EXPECT_EQ(h.timer->LastArmed(), h.Now() + 600000) << "the node behind the head waits for the next tick";
+}
+
+// After a wall clock step the list's order is stale: a pass fires every due node wherever it stands,
+// never arms for a past time, and arms for the earliest node that needs the timer.
+TEST_F(Scheduler, AfterAWallClockStepEveryDueNodeFiresWhereverItStands) {
+    SetOffset(1);  // placed with the wall clock 1 s ahead, then stepped back
+    WaitNode* global = QueueAt(h.Now() + kSecond + 400000, true, h.Now() + 400000);
+    WaitNode* monotonic = QueueAt(h.Now() + 600000, false);
+    ASSERT_EQ(gWaitList.load(), global);
+    SetOffset(0);
+    PassAt(h.Now() + 700000);
+    EXPECT_NE(Fired(monotonic), 0u) << "a due node behind a stepped head did not fire";
+    EXPECT_EQ(Fired(global), 0u) << "fired 1 s early";
+    EXPECT_FALSE(Earlier(h.timer->LastArmed(), h.Now())) << "armed for a time already past";
+    SetOffset(1);
+    PassAt(h.Now() + 1000);
+    EXPECT_NE(Fired(global), 0u);
+
+    SetOffset(0);  // stepped back at a tick's pass, which makes the next deadline anew
+    Tick();
+    const uint64_t tickAt = gNextTick.Load();
+    WaitNode* staleHead = QueueAt(tickAt + 400000, true);
+    WaitNode* earliest = QueueAt(tickAt + 500000, false);
+    ASSERT_EQ(gWaitList.load(), staleHead);
+    SetOffset(-1);
+    PassAt(tickAt);
+    EXPECT_EQ(h.timer->LastArmed(), tickAt + 500000) << "armed for the stale head or the tick";
+    SetOffset(0);
+    PassAt(tickAt + 500000);
+    EXPECT_NE(Fired(staleHead) * Fired(earliest), 0u);
+
+    WaitNode* first = QueueAt(h.Now() + 2 * kSecond, false);  // stepped forward
+    WaitNode* stepped = QueueAt(h.Now() + 3 * kSecond, true);
+    ASSERT_EQ(gWaitList.load(), first);
+    SetOffset(2);
+    PassAt(h.Now() + 1500 * kMs);
+    EXPECT_NE(Fired(stepped), 0u) << "a stepped global node waited for the node before it";
+    EXPECT_EQ(Fired(first), 0u);
 }
 
 }  // namespace
