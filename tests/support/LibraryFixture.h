@@ -8,21 +8,41 @@
 #include <vector>
 
 #include "LoadedLibrary.h"
+#include "tLinux/PalSemaphoreOps.h"
 
 namespace testsupport {
 
 inline uint64_t U64(const ClockTime& t) { return (static_cast<uint64_t>(t.high) << 32) | t.low; }
-inline ClockTime CT(uint64_t v) {
-    return ClockTime{static_cast<uint32_t>(v), static_cast<uint32_t>(v >> 32)};
+inline ClockTime CT(uint64_t v) { return ClockTime{static_cast<uint32_t>(v), static_cast<uint32_t>(v >> 32)}; }
+
+// Posts not yet taken, taking them all.
+inline int Drain(PalSemaphore* s) {
+    int n = 0;
+    while (quelta::PalSemaphoreWait(s, 0) == 0) ++n;
+    return n;
+}
+
+// Exactly 128 nodes can be taken (and are given back); the 129th is refused.
+// `whileFull` runs while all 128 are held.
+template <typename F>
+void ExpectPoolWhole(const LoadedLibrary& lib, F whileFull) {
+    PalSemaphore* s = NewRuntimeSemaphore();
+    ClockTime now;
+    lib.engine()->ReadMonotonic0(now);
+    const ClockTime far = CT(U64(now) + 60000ull * 1000000ull);
+    std::vector<WaitNode*> nodes(128);
+    for (WaitNode*& n : nodes) ASSERT_EQ(lib.api().EventWaitCallback(s, &far, nullptr, nullptr, 0, &n), 0u);
+    WaitNode* extra = nullptr;
+    EXPECT_EQ(lib.api().EventWaitCallback(s, &far, nullptr, nullptr, 0, &extra), 3u);
+    whileFull(s);
+    for (WaitNode* n : nodes) lib.engine()->ReleaseWait(n);  // cancels
+    DeleteRuntimeSemaphore(s);
 }
 
 class LibraryFixture : public ::testing::Test {
 protected:
     static void SetUpTestSuite() { lib = new LoadedLibrary(); }
-    static void TearDownTestSuite() {
-        delete lib;
-        lib = nullptr;
-    }
+    static void TearDownTestSuite() { delete lib, lib = nullptr; }
     void SetUp() override { ASSERT_TRUE(lib->ok()) << lib->error(); }
     const QueltaApi& api() { return lib->api(); }
     iKPusTimingEngine* engine() { return lib->engine(); }
@@ -36,28 +56,10 @@ protected:
         engine()->ReadGlobal2(g);
         return U64(g);
     }
-    // Exactly 128 nodes can be taken (and are given back); the 129th is
-    // refused. `whileFull` runs while all 128 are held.
     template <typename F>
-    void ExpectPoolWhole(F whileFull) {
-        PalSemaphore* s = NewRuntimeSemaphore();
-        const ClockTime far = CT(MonoNow() + 60000ull * 1000000ull);
-        std::vector<WaitNode*> nodes;
-        for (int i = 0; i < 128; ++i) {
-            WaitNode* n = nullptr;
-            ASSERT_EQ(api().EventWaitCallback(s, &far, nullptr, nullptr, 0, &n), 0u) << i;
-            nodes.push_back(n);
-        }
-        WaitNode* extra = nullptr;
-        EXPECT_EQ(api().EventWaitCallback(s, &far, nullptr, nullptr, 0, &extra), 3u);
-        whileFull(s);
-        for (WaitNode* n : nodes) engine()->ReleaseWait(n);  // cancels
-        DeleteRuntimeSemaphore(s);
-    }
-    void ExpectPoolWhole() {
-        ExpectPoolWhole([](PalSemaphore*) {});
-    }
-    static LoadedLibrary* lib;
+    void ExpectPoolWhole(F whileFull) { testsupport::ExpectPoolWhole(*lib, whileFull); }
+    void ExpectPoolWhole() { ExpectPoolWhole([](PalSemaphore*) {}); }
+    static inline LoadedLibrary* lib = nullptr;
 };
 
 }  // namespace testsupport

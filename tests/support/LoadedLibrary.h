@@ -9,23 +9,22 @@
 
 namespace testsupport {
 
+// Every entry a runtime resolves by name: X(field, exported symbol).
+#define QUELTA_API_ENTRIES(X)                                                                              \
+    X(WaitUntilClocks, quelta_iTSC_WaitUntilClocks_C) X(WaitUntilClocks64, quelta_iTSC_WaitUntilClocks64_C) \
+    X(WaitClocks, quelta_iTSC_WaitClocks_C) X(WaitUntilNextMultipleClocks, quelta_iTSC_WaitUntilNextMultipleClocks_C) \
+    X(WaitMicroSeconds, quelta_iTSC_WaitMicroSeconds_C) X(WaitUntilMicroSeconds, quelta_iTSC_WaitUntilMicroSeconds_C) \
+    X(WaitUntilNextMultipleMicroSeconds, quelta_iTSC_WaitUntilNextMultipleMicroSeconds_C)                   \
+    X(GetCPUSpeed, quelta_iTSC_GetCPUSpeed_C) X(GetCPUTicksPerMS, quelta_iTSC_GetCPUTicksPerMS_C)           \
+    X(WaitUntilGlobalClocks64, quelta_iTSC_WaitUntilGlobalClocks64_C) X(EventWait, quelta_iTSCEvent_Wait_C) \
+    X(EventWaitCallback, quelta_iTSCEvent_Wait_Callback_C) X(SetCallback, quelta_iTSC_SetCallback)          \
+    X(SetCallbackTime, quelta_iTSC_SetCallbackTime) X(GetEngine, GetEngine__MERIDOX)                        \
+    X(GetLogEngine, GetLogEngine__MERIDOX)
+
 struct QueltaApi {
-    decltype(&quelta_iTSC_WaitUntilClocks_C) WaitUntilClocks;
-    decltype(&quelta_iTSC_WaitUntilClocks64_C) WaitUntilClocks64;
-    decltype(&quelta_iTSC_WaitClocks_C) WaitClocks;
-    decltype(&quelta_iTSC_WaitUntilNextMultipleClocks_C) WaitUntilNextMultipleClocks;
-    decltype(&quelta_iTSC_WaitMicroSeconds_C) WaitMicroSeconds;
-    decltype(&quelta_iTSC_WaitUntilMicroSeconds_C) WaitUntilMicroSeconds;
-    decltype(&quelta_iTSC_WaitUntilNextMultipleMicroSeconds_C) WaitUntilNextMultipleMicroSeconds;
-    decltype(&quelta_iTSC_GetCPUSpeed_C) GetCPUSpeed;
-    decltype(&quelta_iTSC_GetCPUTicksPerMS_C) GetCPUTicksPerMS;
-    decltype(&quelta_iTSC_WaitUntilGlobalClocks64_C) WaitUntilGlobalClocks64;
-    decltype(&quelta_iTSCEvent_Wait_C) EventWait;
-    decltype(&quelta_iTSCEvent_Wait_Callback_C) EventWaitCallback;
-    decltype(&quelta_iTSC_SetCallback) SetCallback;
-    decltype(&quelta_iTSC_SetCallbackTime) SetCallbackTime;
-    decltype(&GetEngine__MERIDOX) GetEngine;
-    decltype(&GetLogEngine__MERIDOX) GetLogEngine;
+#define QUELTA_API_FIELD(field, symbol) decltype(&symbol) field;
+    QUELTA_API_ENTRIES(QUELTA_API_FIELD)
+#undef QUELTA_API_FIELD
 };
 
 class LoadedLibrary {
@@ -48,9 +47,8 @@ private:
     QueltaApi api_{};
 };
 
-// The runtime's own semaphore, created with the test's copy of the platform
-// layer (as a runtime would with its own). Needs PalInitialize first; this
-// helper calls it.
+// The runtime's own semaphore, made with the test's copy of the platform
+// layer (as a runtime would with its own); initialises that layer once.
 PalSemaphore* NewRuntimeSemaphore();
 void DeleteRuntimeSemaphore(PalSemaphore* s);
 

@@ -16,17 +16,15 @@ uint64_t MonoNowNs() { return Now(CLOCK_MONOTONIC); }
 uint64_t RealNowNs() { return Now(CLOCK_REALTIME); }
 
 uint64_t AwaitNonZero(const std::atomic<uint64_t>& word, uint64_t limitNs) {
-    const uint64_t start = MonoNowNs();
     const timespec ms{0, 1000000};
-    while (word.load() == 0 && MonoNowNs() - start < limitNs) nanosleep(&ms, nullptr);
+    for (const uint64_t start = MonoNowNs(); word.load() == 0 && MonoNowNs() - start < limitNs;) nanosleep(&ms, nullptr);
     return word.load();
 }
 
 bool CanUseRealtime() {
     int policy = 0;
-    sched_param old{};
+    sched_param old{}, p{};
     pthread_getschedparam(pthread_self(), &policy, &old);
-    sched_param p{};
     p.sched_priority = 1;
     if (pthread_setschedparam(pthread_self(), SCHED_FIFO, &p) != 0) return false;
     pthread_setschedparam(pthread_self(), policy, &old);
@@ -37,9 +35,7 @@ static int CountEntries(const char* path) {
     DIR* d = opendir(path);
     if (!d) return -1;
     int n = 0;
-    while (dirent* e = readdir(d)) {
-        if (e->d_name[0] != '.') ++n;
-    }
+    while (dirent* e = readdir(d)) n += e->d_name[0] != '.';
     closedir(d);
     return n;
 }

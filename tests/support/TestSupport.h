@@ -14,12 +14,19 @@ uint64_t MonoNowNs();
 uint64_t RealNowNs();
 
 // Polls `word` every millisecond until it is not zero or `limitNs` have
-// passed; returns what it holds then (0: never set). For callbacks that
-// record when they ran.
+// passed; returns what it holds then (0: never set).
 uint64_t AwaitNonZero(const std::atomic<uint64_t>& word, uint64_t limitNs);
 
-// True when the calling process may use SCHED_FIFO (tests that need it skip
-// otherwise, saying why).
+// Polls `done()` every 200 us for up to `limitNs`; true once it holds.
+template <typename F>
+bool Eventually(F done, uint64_t limitNs = 2000000000ull) {
+    const timespec step{0, 200000};
+    for (const uint64_t end = MonoNowNs() + limitNs; !done(); nanosleep(&step, nullptr))
+        if (MonoNowNs() > end) return false;
+    return true;
+}
+
+// True when the calling process may use SCHED_FIFO.
 bool CanUseRealtime();
 
 // Number of threads of this process (/proc/self/task) and open descriptors.

@@ -1,11 +1,8 @@
-// The shared records as a runtime built with the C library's default time
-// interfaces sees them (32-bit time_t on a 32-bit target): this file alone
-// leaves out the build's 64-bit time settings.
+// This file alone leaves out the build's 64-bit time settings: the C
+// library's default time interfaces (32-bit time_t on a 32-bit target).
 #undef _TIME_BITS
 #undef _FILE_OFFSET_BITS
 #include "Time32Layout.h"
-
-#include <cstddef>
 
 #include "quelta/PalSemaphore.h"
 

@@ -1,0 +1,141 @@
+// The running library with the wall clock moved through the clock seam
+// (CLOCK_REALTIME as the library sees it, never the machine's): in 2040 and
+// 2100 reads carry the 1904 epoch offset exactly, conversions agree with the
+// clocks, and global waits, global-deadline event waits and global callback
+// times end at their time (never early, never lost); steps of the wall clock
+// move global waits and callback times with them.
+#include <gtest/gtest.h>
+#include <stdlib.h>
+
+#include <atomic>
+#include <string>
+#include <thread>
+
+#include "TestSupport.h"
+#include "engine/ClockTimeOps.h"
+#include "engine/EpochOffset.h"
+#include "engine/LibraryFrame.h"
+#include "engine/SystemClock.h"
+#include "quelta/quelta.h"
+#include "tLinux/PalThreads.h"
+
+using namespace quelta;
+
+namespace {
+
+constexpr uint64_t kNs = 1000000000ull, kMs = 1000000ull, kLostAfter = 2000 * kMs;
+constexpr int64_t kSMs = 1000000;
+
+std::atomic<int64_t> gWallShiftNs{0};
+int ShiftedClock(clockid_t id, timespec* ts) {
+    const int r = clock_gettime(id, ts);
+    if (id == CLOCK_REALTIME) *ts = SplitNanoseconds(JoinNanoseconds(*ts) + static_cast<uint64_t>(gWallShiftNs.load()));
+    return r;
+}
+std::atomic<uint64_t> gFiredAt{0};
+void StoreGlobalNow(void*) {
+    ClockTime g;
+    GetEngine__MERIDOX()->ReadGlobal2(g);
+    gFiredAt.store(ToU64(g));
+}
+// The year of a global time (365.2425-day years from 1904; exact enough near a year's start).
+int YearOf(uint64_t global) { return 1904 + static_cast<int>(global / kNs / 31556952u); }
+
+class WallClockLive : public ::testing::TestWithParam<int64_t> {  // the wall clock's first second, Unix time
+protected:
+    void SetUp() override {
+        if (!testsupport::CanUseRealtime()) GTEST_SKIP() << "the timer thread needs SCHED_FIFO";
+        gWallShiftNs = GetParam() == 0 ? 0 : (GetParam() + 3600) * int64_t(kNs) - static_cast<int64_t>(testsupport::RealNowNs());
+        gSystemClock.getTime = ShiftedClock;
+        setenv("TZ", "UTC", 1);
+        ASSERT_EQ(LibraryControl(0, 1, 0), 1u);
+        engine = GetEngine__MERIDOX();
+        gFiredAt = 0;
+    }
+    void TearDown() override {
+        LibraryControl(0, 0, 0);
+        ResetSystemClockHooks();
+        unsetenv("TZ");
+    }
+    uint64_t GlobalNow() { ClockTime g; engine->ReadGlobal2(g); return ToU64(g); }
+    uint64_t MonotonicNow() { ClockTime m; engine->ReadMonotonic0(m); return ToU64(m); }
+    // Runs a blocking call on a thread of its own; still blocked after
+    // kLostAfter, it is lost: false, and the stop releases the caller.
+    template <typename Call>
+    bool EndsInTime(Call call) {
+        std::atomic<bool> done{false};
+        std::thread caller([&] { call(), done = true; });
+        const bool ended = testsupport::Eventually([&] { return done.load(); }, kLostAfter);
+        if (!ended) LibraryControl(0, 0, 0);
+        caller.join();
+        return ended;
+    }
+    // A global wait `ahead` ns long, the wall clock stepped by `step` after 10 ms; its monotonic length.
+    uint64_t GlobalWait(uint64_t ahead, int64_t step = 0) {
+        uint32_t generation = 0, abortFlag = 9;
+        ClockTime g, after{};
+        const uint64_t start = testsupport::MonoNowNs();
+        engine->ReadGlobalWithGeneration(g, generation);
+        const ClockTime target = FromU64(ToU64(g) + ahead);
+        std::thread stepper([step] { if (step) PalSleepMilliseconds(10), gWallShiftNs += step; });
+        EXPECT_TRUE(EndsInTime([&] { quelta_iTSC_WaitUntilGlobalClocks64_C(&target, &abortFlag, &after, generation); }));
+        stepper.join();
+        EXPECT_EQ(abortFlag, 0u);
+        EXPECT_GE(ToU64(after), ToU64(target)) << "early";
+        EXPECT_GE(GlobalNow(), ToU64(target));
+        return testsupport::MonoNowNs() - start;
+    }
+    iKPusTimingEngine* engine = nullptr;
+};
+
+TEST_P(WallClockLive, ReadsConversionsAndEveryGlobalWaitEndAtTheirTime) {
+    EXPECT_EQ(ComputeEpochOffset(), 2082844800);  // 1904 to 1970, in UTC
+    timespec before{}, after{};
+    ShiftedClock(CLOCK_REALTIME, &before);
+    const uint64_t g = GlobalNow();
+    ShiftedClock(CLOCK_REALTIME, &after);
+    EXPECT_GE(g, JoinNanoseconds(before) + 2082844800ull * kNs);
+    EXPECT_LE(g, JoinNanoseconds(after) + 2082844800ull * kNs);
+    if (GetParam() != 0) EXPECT_EQ(YearOf(g), YearOf((GetParam() + 2082844800ll) * kNs));
+    // The present converts to the present either way (1 ms: room for a preempted read).
+    const uint64_t toGlobal = ToU64(engine->MonotonicToGlobal(FromU64(MonotonicNow())));
+    EXPECT_LT(GlobalNow() - toGlobal, kMs);
+    const uint64_t toMonotonic = ToU64(engine->GlobalToMonotonic(FromU64(GlobalNow())));
+    EXPECT_LT(MonotonicNow() - toMonotonic, kMs);
+    for (uint64_t ahead : {0 * kMs, 3 * kMs, 25 * kMs}) GlobalWait(ahead);
+    const ClockTime deadline = FromU64(GlobalNow() + 10 * kMs);
+    uint32_t result = 9;  // neither semaphore nor callback: blocks on the node's own semaphore
+    ASSERT_TRUE(EndsInTime([&] { result = quelta_iTSCEvent_Wait_Callback_C(nullptr, &deadline, nullptr, nullptr, 1, nullptr); }));
+    EXPECT_EQ(result, 0u);
+    EXPECT_GE(GlobalNow(), ToU64(deadline)) << "early";
+    quelta_iTSC_SetCallback(StoreGlobalNow, nullptr);
+    const ClockTime when = FromU64(GlobalNow() + 20 * kMs);
+    ASSERT_EQ(quelta_iTSC_SetCallbackTime(&when, -1), 1u);
+    testsupport::AwaitNonZero(gFiredAt, kLostAfter);
+    quelta_iTSC_SetCallback(nullptr, nullptr);
+    ASSERT_NE(gFiredAt.load(), 0u) << "never fired";
+    EXPECT_GE(gFiredAt.load(), ToU64(when)) << "early";
+}
+
+TEST_P(WallClockLive, GlobalWaitsAndCallbackTimesFollowSteps) {
+    const uint64_t forward = GlobalWait(60 * kMs, 30 * kSMs);  // 60 ms of wall time minus the step
+    EXPECT_GE(forward, 30 * kMs);
+    EXPECT_LT(forward, 55 * kMs);
+    EXPECT_GE(GlobalWait(60 * kMs, -30 * kSMs), 90 * kMs);
+    quelta_iTSC_SetCallback(StoreGlobalNow, nullptr);
+    const ClockTime when = FromU64(GlobalNow() + 80 * kMs);
+    ASSERT_EQ(quelta_iTSC_SetCallbackTime(&when, -1), 1u);
+    const uint64_t start = testsupport::MonoNowNs();
+    PalSleepMilliseconds(10);
+    gWallShiftNs += 50 * kSMs;  // now due 20 ms from here
+    testsupport::AwaitNonZero(gFiredAt, kLostAfter);
+    quelta_iTSC_SetCallback(nullptr, nullptr);
+    ASSERT_NE(gFiredAt.load(), 0u);
+    EXPECT_GE(gFiredAt.load(), ToU64(when)) << "before the wall clock showed it";
+    EXPECT_LT(testsupport::MonoNowNs() - start, 75 * kMs) << "at the unstepped time";
+}
+
+INSTANTIATE_TEST_SUITE_P(Years, WallClockLive, ::testing::Values(0, 2208988800ll, 4102444800ll),
+                         [](const auto& info) { return info.param == 0 ? std::string("Now") : "Unix" + std::to_string(info.param); });
+
+}  // namespace

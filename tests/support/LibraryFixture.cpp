@@ -1,7 +1,0 @@
-#include "LibraryFixture.h"
-
-namespace testsupport {
-
-LoadedLibrary* LibraryFixture::lib = nullptr;
-
-}  // namespace testsupport
