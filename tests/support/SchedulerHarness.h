@@ -1,6 +1,5 @@
-// A scheduler under the test's control: a fake timer that records its arming,
-// an engine whose global clock is the monotonic one plus its epoch offset (0),
-// the wait-node pool without the rest of start-up, and a settable "now".
+// A scheduler under the test's control: a fake timer that records its arming, an engine whose global
+// clock is the monotonic one plus its epoch offset (0), the node pool alone, and a settable "now".
 #ifndef QUELTA_TESTS_SCHEDULERHARNESS_H
 #define QUELTA_TESTS_SCHEDULERHARNESS_H
 
@@ -47,12 +46,9 @@ public:
     ~SchedulerHarness() {  // everything back to its load-time state
         using namespace quelta;
         gTickNowOverride = nullptr;
-        for (WaitNode& n : pool) {
-            if (PalSemaphore* s = n.ownSemaphore.exchange(nullptr)) PalSemaphoreDestroy(s);
-        }
+        for (WaitNode& n : pool) if (PalSemaphore* s = n.ownSemaphore.exchange(nullptr)) PalSemaphoreDestroy(s);
         gEventSystemReady.store(0), gWaitNodePool.store(nullptr), gFreeList.store(nullptr), gWaitList.store(nullptr);
-        RemoveTimer();
-        delete gEngine.exchange(nullptr);
+        RemoveTimer(), delete gEngine.exchange(nullptr);
         gCallbackFn.store(nullptr), gCallbackArg.store(nullptr), gTickCallback.store(nullptr);
         gConvertStandInEnabled.store(true), SetLoadTimeSchedulerState();
     }
@@ -78,10 +74,7 @@ public:
         for (WaitNode* n = quelta::gWaitList.load(); n != nullptr; n = n->next.load()) out.push_back(n);
         return out;
     }
-    uint32_t FreeNodes() const {  // 0 when the pool's lists are broken
-        uint32_t n = 0;
-        return quelta::AuditWaitNodes(&n, nullptr, nullptr) ? n : 0;
-    }
+    uint32_t FreeNodes() const { uint32_t n = 0; return quelta::AuditWaitNodes(&n, nullptr, nullptr) ? n : 0; }  // 0: lists broken
     FakeTimer* timer = nullptr;
     WaitNode pool[quelta::kWaitNodeCount];
 

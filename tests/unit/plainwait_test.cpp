@@ -1,6 +1,5 @@
-// The plain waits, read off the sleeps they ask the kernel for (through the engine's seam) while the
-// clock reads scripted times: every 32- and 64-bit branch exactly, without waiting. Also the 64-bit
-// arithmetic they divide with, and the clock-rate queries.
+// The plain waits, read off the sleeps they ask for (through the engine's seam) while the clock reads
+// scripted times: each 32- and 64-bit branch exactly. Also the arithmetic they divide with, and queries.
 #include <gtest/gtest.h>
 #include <errno.h>
 
@@ -8,7 +7,6 @@
 #include <random>
 #include <tuple>
 #include <vector>
-
 #include "TestSupport.h"
 #include "engine/ClockTimeOps.h"
 #include "engine/ClockWaits.h"
@@ -26,8 +24,7 @@ uint32_t Low(uint64_t t) { return static_cast<uint32_t>(t); }
 uint64_t Join(uint32_t high, uint32_t low) { return (uint64_t(high) << 32) | low; }
 
 // Monotonic reads: the scripted times first, then the real clock; counted.
-class ScriptedEngine : public tKPusTimingEngine {
-public:
+struct ScriptedEngine : tKPusTimingEngine {
     std::vector<uint64_t> script;
     std::atomic<int> reads{0};
     void ReadMonotonic4(ClockTime& out) override {
@@ -36,13 +33,8 @@ public:
     }
 };
 
-// The sleeps asked for, recorded, not slept; the first gInterruptions end with EINTR, gRemaining left.
-struct Sleep {
-    bool until;
-    uint64_t ns;
-    bool operator==(const Sleep& o) const { return until == o.until && ns == o.ns; }
-};
-void PrintTo(const Sleep& s, std::ostream* os) { *os << (s.until ? "until " : "for ") << s.ns; }
+// The sleeps asked for (absolute?, ns), recorded, not slept; the first gInterruptions end with EINTR.
+using Sleep = std::pair<bool, uint64_t>;
 using Sleeps = std::vector<Sleep>;
 Sleeps gSleeps;
 int gInterruptions = 0;
@@ -51,12 +43,11 @@ int RecordSleep(clockid_t clock, int flags, const timespec* request, timespec* r
     EXPECT_EQ(clock, CLOCK_MONOTONIC);
     gSleeps.push_back({flags == TIMER_ABSTIME, JoinNanoseconds(*request)});
     if (gInterruptions == 0) return 0;
-    --gInterruptions;
-    if (remaining != nullptr) *remaining = SplitNanoseconds(gRemaining);
+    if (--gInterruptions, remaining != nullptr) *remaining = SplitNanoseconds(gRemaining);
     return EINTR;
 }
-Sleep Until(uint64_t t) { return {true, t}; }
-Sleep For(uint64_t d) { return {false, d}; }
+Sleep Until(uint64_t t) { return {true, t}; }  // absolute
+Sleep For(uint64_t d) { return {false, d}; }    // relative
 
 class PlainWaitTest : public ::testing::Test {
 protected:
@@ -65,8 +56,7 @@ protected:
     template <typename Fn>
     Sleeps SleepsOf(std::vector<uint64_t> times, Fn fn) {  // what `fn` asks for while the clock reads `times`
         gSleeps.clear(), engine.script = std::move(times), engine.reads = 0;
-        fn();
-        return gSleeps;
+        return fn(), gSleeps;
     }
     uint64_t Us(uint64_t clocks) { return ToU64(engine.ClocksToMicroseconds64Fwd(FromU64(clocks))); }
     ScriptedEngine engine;
@@ -82,14 +72,12 @@ TEST_F(PlainWaitTest, ZeroArgumentsNeitherSleepNorReadTwice) {
         for (int i = 0; i < 5; ++i) {
             uint32_t r = 0;
             EXPECT_EQ(SleepsOf({n}, [&] { r = waits[i](0); }), Sleeps{}) << i << " at " << n;
-            EXPECT_EQ(r, i < 2 ? Low(n) : Low(Us(n))) << i;
-            EXPECT_EQ(engine.reads.load(), 1) << i;
+            EXPECT_EQ(std::tuple(r, engine.reads.load()), std::tuple(i < 2 ? Low(n) : Low(Us(n)), 1)) << i;
         }
     }
-    ClockTime r{0, 0};
+    ClockTime r{0, 0};  // and a 64-bit period of 0
     EXPECT_EQ(SleepsOf({Join(5, 7)}, [&] { r = WaitUntilNextMultipleClocks64Impl(ClockTime{0, 0}); }), Sleeps{});
-    EXPECT_EQ(ToU64(r), Join(5, 7));
-    EXPECT_EQ(engine.reads.load(), 1);
+    EXPECT_EQ(std::tuple(ToU64(r), engine.reads.load()), std::tuple(Join(5, 7), 1));
 }
 
 // A next-multiple wait sleeps until the first multiple strictly after the call (on one: a whole
@@ -124,57 +112,46 @@ TEST_F(PlainWaitTest, NextMultipleIsTheFirstMultipleStrictlyLater) {
     }
 }
 
-// 64-bit targets not after now (high word 0xFFFFFFFF: before all) do not sleep. A 32-bit one just passed
-// (within 1000 * gCpuSpeed) returns at once; further behind, the next 2^32 span; above, this one.
-TEST_F(PlainWaitTest, AbsoluteClockTargets) {
+// 64-bit targets not after now (high word 0xFFFFFFFF: before all) do not sleep; durations are 64-bit.
+TEST_F(PlainWaitTest, Targets64BitAndDurations) {
     const uint64_t n = Join(1, 0x80000000u);
     for (uint64_t target : {n - 1000 * kMs, n, Join(0xFFFFFFFFu, 0x12345678u), n + 1}) {
         const ClockTime t = FromU64(target);
-        EXPECT_EQ(SleepsOf({n}, [&] { quelta_iTSC_WaitUntilClocks64_C(&t); }), target > n && target < Join(0xFFFFFFFFu, 0) ? Sleeps{Until(target)} : Sleeps{}) << target;
+        EXPECT_EQ(SleepsOf({n}, [&] { quelta_iTSC_WaitUntilClocks64_C(&t); }), target == n + 1 ? Sleeps{Until(target)} : Sleeps{}) << target;
         EXPECT_EQ(engine.reads.load(), 2);
     }
-    const struct { uint32_t speed; uint64_t now; uint32_t target; uint64_t deadline; } rows[] = {
-        {1000, n, Low(n), 0},                  // just passed: at once
-        {1000, n, Low(n) - 999999, 0},
-        {2000, n, Low(n) - 1999999, 0},
-        {1000, n, Low(n) - 1000000, Join(2, Low(n) - 1000000)},  // 1 ms behind: the next span
-        {1000, n, Low(n) + 1, n + 1},                            // ahead: this span
-        {1000, Join(1, 0xFFFFFF00u), 5, Join(2, 5)},             // across the wrap
-    };
-    for (const auto& c : rows) {
-        SCOPED_TRACE(c.target);
-        gCpuSpeed = c.speed;
-        uint32_t r = 0;
-        EXPECT_EQ(SleepsOf({c.now}, [&] { r = quelta_iTSC_WaitUntilClocks_C(c.target); }), c.deadline ? Sleeps{Until(c.deadline)} : Sleeps{});
-        EXPECT_EQ(engine.reads.load(), c.deadline ? 2 : 1);
-        if (!c.deadline) EXPECT_EQ(r, Low(c.now));
-    }
-}
-
-// Microseconds: past tolerance 1000 us whatever gCpuSpeed, the next 2^32-us span beyond; 64-bit durations.
-TEST_F(PlainWaitTest, MicrosecondTargetsAndDurations) {
-    gCpuSpeed = 5000;
-    const uint64_t n = Join(3, 987654321u), u = Us(n);
-    const uint32_t low = Low(u), high = static_cast<uint32_t>(u >> 32);
-    for (uint32_t behind : {0u, 999u}) {
-        uint32_t r = 0;
-        EXPECT_EQ(SleepsOf({n}, [&] { r = quelta_iTSC_WaitUntilMicroSeconds_C(low - behind); }), Sleeps{}) << behind;
-        EXPECT_EQ(r, low);
-        EXPECT_EQ(engine.reads.load(), 1);
-    }
-    EXPECT_EQ(SleepsOf({n}, [&] { quelta_iTSC_WaitUntilMicroSeconds_C(low - 1000); }), Sleeps{Until(Join(high + 1, low - 1000) * 1000)});
-    EXPECT_EQ(SleepsOf({n}, [&] { quelta_iTSC_WaitUntilMicroSeconds_C(low + 1); }), Sleeps{Until(Join(high, low + 1) * 1000)});
     EXPECT_EQ(SleepsOf({n}, [] { quelta_iTSC_WaitMicroSeconds_C(4294968u); }), Sleeps{For(4294968000ull)});
     EXPECT_EQ(SleepsOf({n}, [] { quelta_iTSC_WaitClocks_C(0xFFFFFFFFu); }), Sleeps{For(0xFFFFFFFFull)});
 }
 
+// A 32-bit target just passed (within 1000 * gCpuSpeed clocks, or 1000 us whatever gCpuSpeed) returns at
+// once with one read; further behind, it lies in the next 2^32 span; above the low word, in this one.
+TEST_F(PlainWaitTest, Targets32BitLieInThisSpanOrTheNext) {
+    const uint64_t n = Join(1, 0x80000000u), m = Join(3, 987654321u), u = Us(m);
+    const uint32_t lu = Low(u), hu = static_cast<uint32_t>(u >> 32);
+    const struct { bool micro; uint32_t speed; uint64_t now; uint32_t target; uint64_t deadline; } rows[] = {
+        {false, 1000, n, Low(n), 0}, {false, 1000, n, Low(n) - 999999, 0}, {false, 2000, n, Low(n) - 1999999, 0},
+        {false, 1000, n, Low(n) - 1000000, Join(2, Low(n) - 1000000)},  // 1 ms behind: the next span
+        {false, 1000, n, Low(n) + 1, n + 1}, {false, 1000, Join(1, 0xFFFFFF00u), 5, Join(2, 5)},  // ahead; across the wrap
+        {true, 5000, m, lu, 0}, {true, 5000, m, lu - 999, 0},
+        {true, 5000, m, lu - 1000, Join(hu + 1, lu - 1000) * 1000}, {true, 5000, m, lu + 1, Join(hu, lu + 1) * 1000}};
+    for (const auto& c : rows) {
+        SCOPED_TRACE(testing::Message() << c.micro << " " << c.target);
+        gCpuSpeed = c.speed;
+        uint32_t r = 0;
+        EXPECT_EQ(SleepsOf({c.now}, [&] { r = (c.micro ? quelta_iTSC_WaitUntilMicroSeconds_C : quelta_iTSC_WaitUntilClocks_C)(c.target); }),
+                  c.deadline ? Sleeps{Until(c.deadline)} : Sleeps{});
+        EXPECT_EQ(engine.reads.load(), c.deadline ? 2 : 1);
+        if (!c.deadline) { EXPECT_EQ(r, c.micro ? lu : Low(c.now)); }
+    }
+}
+
 // A sleep ended by a signal resumes: absolute on its deadline, relative on what is left.
 TEST_F(PlainWaitTest, InterruptedSleepsResume) {
-    gRemaining = 12345678;
-    gInterruptions = 2;
+    gRemaining = 12345678, gInterruptions = 2;
     EXPECT_EQ(SleepsOf({0}, [] { quelta_iTSC_WaitClocks_C(40000000u); }), (Sleeps{For(40000000), For(12345678), For(12345678)}));
-    gInterruptions = 2;
     const ClockTime t = FromU64(Join(9, 9));
+    gInterruptions = 2;
     EXPECT_EQ(SleepsOf({Join(9, 1)}, [&] { quelta_iTSC_WaitUntilClocks64_C(&t); }), Sleeps(3, Until(Join(9, 9))));
 }
 
@@ -182,8 +159,7 @@ TEST_F(PlainWaitTest, InterruptedSleepsResume) {
 TEST_F(PlainWaitTest, QueriesFallBackIndependently) {
     for (auto [speed, reported, perMs] : {std::tuple{0u, 1u, 1000000u}, {1000u, 1000u, 1000000u}, {5000000u, 5000000u, uint32_t(5000000000ull)}}) {
         gCpuSpeed = speed;
-        EXPECT_EQ(quelta_iTSC_GetCPUSpeed_C(), reported);
-        EXPECT_EQ(quelta_iTSC_GetCPUTicksPerMS_C(), perMs);
+        EXPECT_EQ(std::tuple(quelta_iTSC_GetCPUSpeed_C(), quelta_iTSC_GetCPUTicksPerMS_C()), std::tuple(reported, perMs));
     }
 }
 
@@ -194,41 +170,23 @@ TEST(PlainWaitWithoutEngine, WaitsOnTheKernelClock) {
 }
 
 using QR = std::pair<uint64_t, uint64_t>;  // quotient, remainder
-uint64_t Mul(uint64_t x, uint32_t m) {
-    ClockTime v = FromU64(x);
-    return U64MulU32(v, m), ToU64(v);
-}
-QR Div(uint64_t n, uint64_t d) {
-    ClockTime q = FromU64(n), r = FromU64(d);
-    return U64DivMod(q, r), QR(ToU64(q), ToU64(r));
-}
-// Division but for two rules: by 0, or high word 0xFFFFFFFF by a divisor without, gives 0 and the dividend.
-QR Reference(uint64_t n, uint64_t d) {
-    if (d == 0 || ((n >> 32) == 0xFFFFFFFFu && (d >> 32) != 0xFFFFFFFFu)) return {0, n};
-    return {n / d, n % d};
-}
+uint64_t Mul(uint64_t x, uint32_t m) { ClockTime v = FromU64(x); return U64MulU32(v, m), ToU64(v); }
+QR Div(uint64_t n, uint64_t d) { ClockTime q = FromU64(n), r = FromU64(d); return U64DivMod(q, r), QR(ToU64(q), ToU64(r)); }
 
-// The library's multiply and divide against the compiler's: word boundaries, powers of two and
-// neighbours crossed, then random operands of random bit length (quotients of every size).
+// The library's multiply and divide against the compiler's, on word boundaries, powers of two and their
+// neighbours crossed, then random operands of random bit length (quotients of every size). Division by
+// 0, or of a high word 0xFFFFFFFF by a divisor without one, gives 0 and the dividend back.
 TEST(U64Arith, MatchesNativeArithmeticButForItsTwoRules) {
-    std::vector<uint64_t> values = {0, 3, 10, 999999, 1000000000, 0xFFFFFFFEFFFFFFFFull, 0xFFFFFFFF00000000ull,
-                                    0xFFFFFFFF00000001ull, ~uint64_t(0)};
-    for (int bit = 0; bit < 64; bit += 5) {
-        for (int delta : {-1, 0, 1}) values.push_back((uint64_t(1) << bit) + delta);
-    }
-    std::vector<QR> pairs;
-    for (uint64_t a : values) {
-        for (uint64_t b : values) pairs.emplace_back(a, b);
-    }
+    std::vector<uint64_t> v = {0, 3, 10, 999999, 1000000000, 0xFFFFFFFEFFFFFFFF, 0xFFFFFFFF00000000, 0xFFFFFFFF00000001, ~0ull};
+    for (int bit = 0; bit < 64; bit += 5) for (int delta : {-1, 0, 1}) v.push_back((uint64_t(1) << bit) + delta);
     std::mt19937_64 rng(20240611);
-    auto random = [&rng] {
-        const unsigned bits = static_cast<unsigned>(rng() % 65);
-        return bits == 64 ? rng() : rng() & ((uint64_t(1) << bits) - 1);
-    };
-    for (int i = 0; i < 200000; ++i) pairs.emplace_back(random(), random());
-    for (const auto& [a, b] : pairs) {
+    auto random = [&rng] { const unsigned bits = rng() % 65; return bits == 64 ? rng() : rng() & ((uint64_t(1) << bits) - 1); };
+    const size_t crossed = v.size() * v.size();
+    for (size_t i = 0; i < crossed + 200000; ++i) {
+        const uint64_t a = i < crossed ? v[i / v.size()] : random(), b = i < crossed ? v[i % v.size()] : random();
+        const bool rule = b == 0 || ((a >> 32) == 0xFFFFFFFFu && (b >> 32) != 0xFFFFFFFFu);
         ASSERT_EQ(Mul(a, Low(b)), a * Low(b)) << std::hex << a << " * " << Low(b);  // modulo 2^64
-        ASSERT_EQ(Div(a, b), Reference(a, b)) << std::hex << a << " / " << b;
+        ASSERT_EQ(Div(a, b), rule ? QR(0, a) : QR(a / b, a % b)) << std::hex << a << " / " << b;
     }
 }
 

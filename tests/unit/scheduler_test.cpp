@@ -1,16 +1,22 @@
-// The tick scheduler driven deterministically: passes at chosen times, a fake timer, recording callbacks.
+// The tick scheduler driven deterministically (passes at chosen times, a fake timer, recording callbacks),
+// and the event and global-clock waits on it, each blocking wait on a thread of its own.
 #include <gtest/gtest.h>
+#include <pthread.h>
 #include <time.h>
+#include <unistd.h>
 
 #include <atomic>
+#include <cstdio>
+#include <thread>
 #include <tuple>
-#include <vector>
-
 #include "SchedulerHarness.h"
+#include "TestSupport.h"
+#include "engine/LibraryUse.h"
 #include "engine/SystemClock.h"
 #include "quelta/quelta.h"
 
 using namespace quelta;
+using testsupport::MonoNowNs;
 
 namespace {
 
@@ -29,21 +35,17 @@ void RecordCallback(void* arg) { gCalls.push_back({arg, ToU64(*static_cast<Clock
 Tags gFired;
 uint32_t gRelease = 0;  // what the wait callback asks for
 uint32_t RecordFire(void* arg) { return gFired.push_back(int(reinterpret_cast<intptr_t>(arg))), gRelease; }
-std::atomic<int> gClockReads{0};
-int CountingGetTime(clockid_t id, timespec* ts) { return gClockReads.fetch_add(1), clock_gettime(id, ts); }
 
 class Scheduler : public ::testing::Test {
 protected:
     void SetUp() override { gTicks.clear(), gCalls.clear(), gFired.clear(), gRelease = 0; }
     void TearDown() override { ResetSystemClockHooks(); }
-    // Queues `n` at `deadline`; `tag` is what RecordFire records when it fires.
-    uint32_t Queue(WaitNode* n, uint64_t deadline, int tag = 0, QueltaWaitCallbackFn cb = RecordFire) {
+    uint32_t Queue(WaitNode* n, uint64_t deadline, int tag = 0, QueltaWaitCallbackFn cb = RecordFire) {  // tag: for RecordFire
         const ClockTime d = FromU64(deadline);
         return InsertWaitNode(n, &d, cb, reinterpret_cast<void*>(intptr_t(tag)));
     }
-    // Released as it fires; its waiter wakes by itself at `selfWake` (0: never).
-    WaitNode* QueueAt(uint64_t deadline, bool global, uint64_t selfWake = 0) {
-        WaitNode* n = h.Take(global, 1, 0, selfWake);
+    WaitNode* QueueAt(uint64_t deadline, bool global, uint64_t selfWake = 0) {  // released as it fires
+        WaitNode* n = h.Take(global, 1, 0, selfWake);  // its waiter wakes by itself at selfWake (0: never)
         EXPECT_EQ(Queue(n, deadline, 0, nullptr), 0u);
         return n;
     }
@@ -56,14 +58,15 @@ protected:
 };
 
 // Ticks on time: zero jitter, one period apart; a late one served once, not replayed, the grid restarted
-// from it; the tick serial counts only while a tick callback is registered.
+// from it; the tick serial counts only while a tick callback is registered. The jitter samples fill an
+// array of 1000: a count at its end or below 0 records nothing, nor beside it.
 TEST_F(Scheduler, TicksKeepTheGridAndAreNeverReplayed) {
     auto* engine = gEngine.load();
     engine->statsCount.store(0), engine->statsEnabled.store(1);
     for (int i = 0; i < 500; ++i) Tick();
     EXPECT_EQ(std::tuple(engine->statsCount.load(), engine->stats.jitterSamples[0].load()), std::tuple(500, 0u));
     EXPECT_EQ(std::tuple(gNextTick.Load(), h.timer->LastArmed()), std::tuple(h.Now() + kMs, h.Now() + kMs));
-    gTickCallback.store(RecordTick);
+    engine->RegisterTickCallback(RecordTick);
     const uint64_t late = gNextTick.Load() + 3 * kMs + kMs / 2;
     PassAt(late);
     EXPECT_EQ(std::tuple(gNextTick.Load(), h.timer->LastArmed()), std::tuple(late, late));  // next tick at once
@@ -71,25 +74,19 @@ TEST_F(Scheduler, TicksKeepTheGridAndAreNeverReplayed) {
     EXPECT_EQ(gNextTick.Load(), late + kMs);
     PassAt(late + kMs / 2);  // no tick due
     EXPECT_EQ(gTicks, (std::vector<uint64_t>{0, 1}));
-}
-
-// The jitter samples fill an array of 1000; a count at its end or below 0 records nothing, nor beside it.
-TEST_F(Scheduler, JitterSamplesStayInsideTheirArray) {
-    auto* engine = gEngine.load();
     engine->stats.globalReadExtra.store(0x5A5A5A5Au), engine->stats.rawReadSamples[0].store(0xA5A5A5A5u);
-    engine->statsEnabled.store(1);
     for (int32_t count : {999, 1000, -1}) {
         engine->statsCount.store(count);
         PassAt(gNextTick.Load() + 123);
         EXPECT_EQ(engine->statsCount.load(), count == 999 ? 1000 : count);
     }
-    EXPECT_EQ(engine->stats.jitterSamples[999].load(), 123u);
-    EXPECT_EQ(std::tuple(engine->stats.rawReadSamples[0].load(), engine->stats.globalReadExtra.load()),
-              std::tuple(0xA5A5A5A5u, 0x5A5A5A5Au));
+    EXPECT_EQ(std::tuple(engine->stats.jitterSamples[999].load(), engine->stats.rawReadSamples[0].load(),
+                         engine->stats.globalReadExtra.load()), std::tuple(123u, 0xA5A5A5A5u, 0x5A5A5A5Au));
 }
 
-// Both callback times due exactly at a pass: two calls, given the pass's now (no argument set).
-TEST_F(Scheduler, BothCallbackTimesDueInOnePassCallTwice) {
+// Both callback times due exactly at a pass: two calls, given the pass's now when no argument is set;
+// NeverTime cancels a callback time; a set argument is what the callback gets.
+TEST_F(Scheduler, CallbackTimesAreDueAtTheirTimeAndNeverTimeCancels) {
     quelta_iTSC_SetCallback(RecordCallback, nullptr);
     const uint64_t t = h.Now() + 100;
     EXPECT_EQ(SetCallbackTime(t, 0) + SetCallbackTime(t, -1), 2u);
@@ -98,6 +95,14 @@ TEST_F(Scheduler, BothCallbackTimesDueInOnePassCallTwice) {
     ASSERT_EQ(gCalls.size(), 2u);
     EXPECT_EQ(std::tuple(gCalls[0].seen, gCalls[1].seen), std::tuple(t, t));
     EXPECT_TRUE(IsNever(gMonotonicCallbackTime.Load()) && IsNever(gGlobalCallbackTime.Load()));
+    ClockTime token{42, 0};
+    quelta_iTSC_SetCallback(RecordCallback, &token);
+    SetCallbackTime(t + 10, 0);
+    EXPECT_EQ(SetCallbackTime(kNeverTime64, 0), 1u);
+    PassAt(t + 100);
+    SetCallbackTime(t + 10, 0), h.Pass();
+    ASSERT_EQ(gCalls.size(), 3u) << "a cancelled time was called";
+    EXPECT_EQ(std::tuple(gCalls[2].arg, gCalls[2].seen), std::tuple((void*)&token, 42ull));
 }
 
 // A callback time ticks ahead is stored unarmed, then folded by each tick: the one before it arms for it.
@@ -111,42 +116,10 @@ TEST_F(Scheduler, ALaterCallbackTimeIsFoldedAndArmedExactly) {
         EXPECT_EQ(h.timer->armed.size(), armed) << clock;
         while (gNextTick.Load() + kMs <= when) Tick();
         Tick();
-        EXPECT_EQ(h.timer->LastArmed(), when) << clock;
-        EXPECT_TRUE(gCalls.empty());
+        EXPECT_EQ(std::tuple(h.timer->LastArmed(), gCalls.size()), std::tuple(when, size_t(0))) << clock;
         PassAt(when);
         EXPECT_EQ(gCalls.size(), 1u) << clock;
     }
-}
-
-void ReArmingCallback(void* arg) {
-    gCalls.push_back({arg, 0});
-    const ClockTime next = FromU64(ToU64(*static_cast<ClockTime*>(arg)) + 250000);
-    if (gCalls.size() < 3) quelta_iTSC_SetCallbackTime(&next, 0);
-}
-
-TEST_F(Scheduler, ACallbackSettingItsNextTimeIsArmedAtOnce) {
-    quelta_iTSC_SetCallback(ReArmingCallback, nullptr);
-    SetCallbackTime(h.Now() + 100000, 0);
-    PassAt(h.Now() + 100000);
-    EXPECT_EQ(gCalls.size(), 1u);
-    EXPECT_EQ(gMonotonicCallbackTime.Load(), h.Now() + 250000);
-    EXPECT_EQ(h.timer->LastArmed(), h.Now() + 250000);  // the pass kept the earlier time
-    PassAt(h.Now() + 250000);
-    EXPECT_EQ(gCalls.size(), 2u);
-}
-
-// NeverTime cancels a callback time; a set argument is what the callback gets.
-TEST_F(Scheduler, CallbackArgumentAndNeverTimeCancel) {
-    ClockTime token{42, 0};
-    quelta_iTSC_SetCallback(RecordCallback, &token);
-    SetCallbackTime(h.Now() + 10, 0);
-    EXPECT_EQ(SetCallbackTime(kNeverTime64, 0), 1u);
-    PassAt(h.Now() + 100);
-    EXPECT_TRUE(gCalls.empty());
-    SetCallbackTime(h.Now() - 90, 0);
-    h.Pass();
-    ASSERT_EQ(gCalls.size(), 1u);
-    EXPECT_EQ(std::tuple(gCalls[0].arg, gCalls[0].seen), std::tuple((void*)&token, 42ull));
 }
 
 // A NeverTime global callback time is neither converted (at +100 s it would arm early) nor folded.
@@ -155,23 +128,17 @@ TEST_F(Scheduler, NeverTimeGlobalCallbackTimeIsNeitherConvertedNorFolded) {
     MoveTo(kNeverTime64 - 100 * kSecond - 400000);
     quelta_iTSC_SetCallback(RecordCallback, nullptr);
     EXPECT_EQ(SetCallbackTime(kNeverTime64, -1), 1u);
-    EXPECT_TRUE(h.timer->armed.empty()) << "armed for a cancelled callback time";
-    EXPECT_TRUE(IsNever(gGlobalCallbackTime.Load()));
+    EXPECT_TRUE(h.timer->armed.empty() && IsNever(gGlobalCallbackTime.Load())) << "armed for a cancelled time";
     h.Pass();
     EXPECT_EQ(h.timer->LastArmed(), h.Now() + kMs) << "a cancelled callback time was folded";
     EXPECT_TRUE(gCalls.empty());
 }
 
-TEST_F(Scheduler, TickCallbackRegistrationAndControlFlag) {
+TEST_F(Scheduler, TickCallbackUnregistrationAndControlFlag) {
     iKPusTimingEngine* e = gEngine.load();
-    e->RegisterTickCallback(RecordTick);
-    EXPECT_EQ(gTickCallback.load(), &RecordTick);
-    e->UnregisterTickCallback(nullptr);  // another function: cleared all the same
+    e->RegisterTickCallback(RecordTick), e->UnregisterTickCallback(nullptr);  // another function: cleared all the same
     EXPECT_EQ(gTickCallback.load(), nullptr);
-    for (auto [set, flag] : {std::pair{1u, 1u}, {3u, 1u}, {2u, 0u}}) {
-        e->SetControlFlag(set);
-        EXPECT_EQ(gControlFlag.load(), flag) << set;
-    }
+    for (auto [set, flag] : {std::pair{1u, 1u}, {3u, 1u}, {2u, 0u}}) EXPECT_EQ((e->SetControlFlag(set), gControlFlag.load()), flag) << set;
 }
 
 // A deadline equal to now is due; nodes fire in list order (equal ones as they came), the rest is folded.
@@ -184,9 +151,7 @@ TEST_F(Scheduler, DueNodesFireInListOrderAndTheNextIsFolded) {
     }
     EXPECT_EQ(h.ListOrder(), (Nodes{a, x, y, z, d}));
     PassAt(now + 300);
-    EXPECT_EQ(gFired, (Tags{4, 1, 2, 3}));
-    EXPECT_EQ(h.ListOrder(), Nodes{d});
-    EXPECT_EQ(h.timer->LastArmed(), now + 600000);
+    EXPECT_EQ(std::tuple(gFired, h.ListOrder(), h.timer->LastArmed()), std::tuple(Tags{4, 1, 2, 3}, Nodes{d}, now + 600000));
     for (WaitNode* n : {x, y, z, a}) EXPECT_EQ(std::tuple(Fired(n), State(n)), std::tuple(1u, kDone));
     for (WaitNode* n : {x, y, z, a, d}) ReleaseWaitNode(n);  // d: cancels the queued wait
     EXPECT_EQ(h.FreeNodes(), kWaitNodeCount);
@@ -195,9 +160,7 @@ TEST_F(Scheduler, DueNodesFireInListOrderAndTheNextIsFolded) {
 // Whether a fired node goes back to the pool: the callback's answer, or autoRelease without one.
 TEST_F(Scheduler, ReleaseDecisionComesFromTheCallbackOrAutoRelease) {
     WaitNode *keep = h.Take(0, 0), *back = h.Take(0, 0), *plain = h.Take(0, 1);
-    Queue(keep, h.Now() + 1);
-    PassAt(h.Now() + 2);
-    gRelease = 1;
+    Queue(keep, h.Now() + 1), PassAt(h.Now() + 2), gRelease = 1;
     Queue(back, h.Now() + 1), Queue(plain, h.Now() + 1, 0, nullptr);
     PassAt(h.Now() + 2);
     EXPECT_EQ(std::tuple(State(keep), State(back), State(plain)), std::tuple(kDone, kFree, kFree));
@@ -228,35 +191,19 @@ TEST_F(Scheduler, WithoutATimerWhatWouldNeedItIsRefused) {
     h.RemoveTimer();
     const uint64_t deadline = gNextDeadline.Load();
     EXPECT_EQ(SetCallbackTime(h.Now() + 10, 0), 0u);
-    EXPECT_TRUE(IsNever(gMonotonicCallbackTime.Load()));
-    EXPECT_EQ(gNextDeadline.Load(), deadline);
+    EXPECT_EQ(std::tuple(gMonotonicCallbackTime.Load(), gNextDeadline.Load()), std::tuple(kNeverTime64, deadline));
     EXPECT_EQ(SetCallbackTime(h.Now() + 50 * kMs, 0), 1u);
     EXPECT_EQ(gMonotonicCallbackTime.Load(), h.Now() + 50 * kMs);
-    EXPECT_EQ(Queue(held, h.Now() + 100), 1u);
-    EXPECT_EQ(State(held), kHeld);
-    EXPECT_EQ(Queue(autoNode, h.Now() + 100), 1u);
-    EXPECT_EQ(gFreeList.load(), autoNode);
-    EXPECT_EQ(Queue(behind, h.Now() + 900000), 1u);
-    EXPECT_EQ(h.ListOrder(), Nodes{queued});
+    EXPECT_EQ(Queue(held, h.Now() + 100) + Queue(autoNode, h.Now() + 100) + Queue(behind, h.Now() + 900000), 3u);
+    EXPECT_EQ(std::tuple(State(held), gFreeList.load(), h.ListOrder()), std::tuple(kHeld, autoNode, Nodes{queued}));
     for (WaitNode* n : {behind, held, queued}) ReleaseWaitNode(n);
-    EXPECT_EQ(h.FreeNodes(), kWaitNodeCount);
-}
-
-TEST_F(Scheduler, BadReleasesAreRefusedWithoutCorruptingTheLists) {
-    WaitNode foreign{};
-    WaitNode *unused = gFreeList.load(), *n = h.Take();
-    for (WaitNode* bad : {unused, n, n, &foreign, reinterpret_cast<WaitNode*>(reinterpret_cast<char*>(n) + 4)}) {
-        ReleaseWaitNode(bad);  // never taken, twice, not of the pool, inside a node
-    }
     EXPECT_EQ(h.FreeNodes(), kWaitNodeCount);
 }
 
 // NeverTime is one value: a time with only one of its words is an ordinary time; so is a tick there.
 TEST_F(Scheduler, NeverTimeIsRecognisedOnlyWhenBothWordsMatch) {
     for (uint64_t t : {0x00000005FFFFFFFFull, 0xFFFFFFFE00000005ull}) {
-        gFired.clear();
-        MoveTo(t - 400000);
-        h.Pass();
+        gFired.clear(), MoveTo(t - 400000), h.Pass();
         EXPECT_EQ(h.timer->LastArmed(), t + 600000) << t << ": the next tick was not armed";
         WaitNode* n = h.Take();
         ASSERT_EQ(Queue(n, t, 7), 0u);
@@ -301,44 +248,27 @@ TEST_F(Scheduler, AGlobalNodeQueuedAsAPassAtRestBeginsIsConverted) {
     EXPECT_EQ(Fired(arrived), 1u);
 }
 
-// Global = monotonic + 100 s: deadlines before the monotonic zero (50 s) or the global one are past.
-TEST_F(Scheduler, AGlobalDeadlineBeforeTheMonotonicZeroIsPast) {
-    SetOffset(100);
-    for (uint64_t at : {50 * kSecond, uint64_t(0xFFFFFFFF00000005ull), 200 * kSecond}) QueueAt(at, true);
-    EXPECT_EQ(h.timer->LastArmed(), 0u) << "a past deadline arms the timer at once";
-    h.Pass();
-    EXPECT_EQ(h.ListOrder().size(), 1u) << "a past deadline was not fired";
-    EXPECT_EQ(gNextDeadline.Load(), h.Now() + kMs) << "the later node is folded, the tick comes first";
+// A global deadline before the monotonic zero, or with high word 0xFFFFFFFF, is past: armed at once
+// and fired; one beyond the monotonic range (within the offset of NeverTime) is the latest time.
+TEST_F(Scheduler, GlobalDeadlinesOutsideTheMonotonicRangeArePastOrLatest) {
+    const struct { int32_t offset; uint64_t at; bool past; } rows[] = {
+        {100, 50 * kSecond, true}, {100, 0xFFFFFFFF00000005, true}, {100, 200 * kSecond, false},
+        {-100, kNeverTime64 - 100 * kSecond + 6, false}};
+    for (const auto& row : rows) {
+        SCOPED_TRACE(row.at);
+        SetOffset(row.offset), h.timer->armed.clear(), gFired.clear();
+        WaitNode* n = h.Take(1, 0);
+        Queue(n, row.at, 1);
+        EXPECT_EQ(h.timer->LastArmed(), row.past ? 0 : kNeverTime64);
+        h.Pass();
+        EXPECT_EQ(gFired, row.past ? Tags{1} : Tags{});
+        EXPECT_EQ(gNextDeadline.Load(), h.Now() + kMs) << "the tick comes first";
+        ReleaseWaitNode(n);
+    }
 }
 
-// Global = monotonic - 100 s: a deadline < 100 s below NeverTime is the latest time, not wrapped.
-TEST_F(Scheduler, AGlobalDeadlineBeyondTheMonotonicRangeIsTheLatest) {
-    SetOffset(-100);
-    QueueAt(kNeverTime64 - 100 * kSecond + 6, true);
-    EXPECT_TRUE(h.timer->armed.empty()) << "a deadline centuries ahead was armed";
-    h.Pass();
-    EXPECT_EQ(h.ListOrder().size(), 1u) << "a deadline at the top of the range was fired";
-}
-
-// With the user-space conversion (it reads the clocks), no insert or pass converts node by node.
-TEST_F(Scheduler, InsertAndPassDoNotConvertNodeByNode) {
-    gConvertStandInEnabled.store(true);
-    const uint64_t base = ToU64(gEngine.load()->MonotonicToGlobal(FromU64(h.Now()))) + 30 * kSecond;
-    for (uint32_t i = 1; i < kWaitNodeCount; ++i) QueueAt(base + i * kMs, true);
-    gSystemClock.getTime = &CountingGetTime;
-    gClockReads.store(0);
-    QueueAt(base + kSecond, true);  // walks past every node
-    // An offset costs a read and up to three brackets of three (more under instrumentation).
-    EXPECT_LE(gClockReads.exchange(0), 16) << "an insert converts every node it passes";
-    h.Pass();
-    EXPECT_LE(gClockReads.load(), 40) << "a pass converts node by node";
-    const Nodes order = h.ListOrder();
-    ASSERT_EQ(order.size(), kWaitNodeCount) << "nodes 30 s ahead were fired";
-    EXPECT_EQ(order.back()->deadline.load(), base + kSecond);
-}
-
-// A global waiter that wakes by itself costs the timer nothing (no arming, no post),
-// unless a wall clock step puts its deadline well before that wake.
+// A global waiter that wakes by itself costs the timer nothing (no arming, no post), unless a wall
+// clock step puts its deadline well before that wake; a node behind it that needs the timer is armed for.
 TEST_F(Scheduler, AWaiterThatWakesByItselfCostsTheTimerThreadNothing) {
     ASSERT_EQ(PalInitialize(), 1u);
     PalSemaphore* semaphore = nullptr;
@@ -346,14 +276,15 @@ TEST_F(Scheduler, AWaiterThatWakesByItselfCostsTheTimerThreadNothing) {
     const uint64_t tick = gNextDeadline.Load();
     auto queue = [&](uint64_t at) {
         WaitNode* n = h.Take(1, 0, 0, at);
-        n->semaphore.store(semaphore);
-        EXPECT_EQ(Queue(n, at, 0, nullptr), 0u);
+        n->semaphore.store(semaphore), Queue(n, at, 0, nullptr);
         return n;
     };
     WaitNode* n = queue(h.Now() + 400000);
     EXPECT_EQ(h.timer->LastArmed(), kNeverTime64) << "armed for a waiter that wakes by itself";
     PassAt(h.Now() + 100000);
     EXPECT_EQ(h.timer->LastArmed(), tick) << "a pass armed for it rather than for the tick";
+    QueueAt(h.Now() + 400000, false);
+    EXPECT_EQ(std::tuple(h.timer->LastArmed(), gWaitList.load()), std::tuple(h.Now() + 400000, n)) << "behind the head";
     PassAt(h.Now() + 400000);
     EXPECT_NE(Fired(n), 0u);
     EXPECT_EQ(PalSemaphoreWait(semaphore, 0), 1u) << "posted a waiter that was waking anyway";
@@ -367,15 +298,6 @@ TEST_F(Scheduler, AWaiterThatWakesByItselfCostsTheTimerThreadNothing) {
     PalSemaphoreDestroy(semaphore);
 }
 
-// A node that needs the timer is armed for even behind a head that wakes by itself.
-TEST_F(Scheduler, ANodeBehindASelfWakingHeadIsArmedFor) {
-    WaitNode* head = QueueAt(h.Now() + 400000, true, h.Now() + 400000);
-    ASSERT_EQ(h.timer->LastArmed(), kNeverTime64);
-    QueueAt(h.Now() + 600000, false);
-    ASSERT_EQ(gWaitList.load(), head);
-    EXPECT_EQ(h.timer->LastArmed(), h.Now() + 600000) << "the node behind the head waits for the next tick";
-}
-
 // After a wall clock step the list's order is stale: a pass fires every due node wherever it stands,
 // never arms for a past time, and arms for the earliest node that needs the timer.
 TEST_F(Scheduler, AfterAWallClockStepEveryDueNodeFiresWhereverItStands) {
@@ -383,35 +305,195 @@ TEST_F(Scheduler, AfterAWallClockStepEveryDueNodeFiresWhereverItStands) {
     WaitNode* global = QueueAt(h.Now() + kSecond + 400000, true, h.Now() + 400000);
     WaitNode* monotonic = QueueAt(h.Now() + 600000, false);
     ASSERT_EQ(gWaitList.load(), global);
-    SetOffset(0);
-    PassAt(h.Now() + 700000);
-    EXPECT_NE(Fired(monotonic), 0u) << "a due node behind a stepped head did not fire";
-    EXPECT_EQ(Fired(global), 0u) << "fired 1 s early";
+    SetOffset(0), PassAt(h.Now() + 700000);
+    EXPECT_EQ(std::tuple(Fired(monotonic), Fired(global)), std::tuple(1u, 0u)) << "the due node behind a stepped head";
     EXPECT_FALSE(Earlier(h.timer->LastArmed(), h.Now())) << "armed for a time already past";
-    SetOffset(1);
-    PassAt(h.Now() + 1000);
+    SetOffset(1), PassAt(h.Now() + 1000);
     EXPECT_NE(Fired(global), 0u);
 
-    SetOffset(0);  // stepped back at a tick's pass, which makes the next deadline anew
-    Tick();
+    SetOffset(0), Tick();  // stepped back at a tick's pass, which makes the next deadline anew
     const uint64_t tickAt = gNextTick.Load();
     WaitNode* staleHead = QueueAt(tickAt + 400000, true);
     WaitNode* earliest = QueueAt(tickAt + 500000, false);
     ASSERT_EQ(gWaitList.load(), staleHead);
-    SetOffset(-1);
-    PassAt(tickAt);
+    SetOffset(-1), PassAt(tickAt);
     EXPECT_EQ(h.timer->LastArmed(), tickAt + 500000) << "armed for the stale head or the tick";
-    SetOffset(0);
-    PassAt(tickAt + 500000);
+    SetOffset(0), PassAt(tickAt + 500000);
     EXPECT_NE(Fired(staleHead) * Fired(earliest), 0u);
 
     WaitNode* first = QueueAt(h.Now() + 2 * kSecond, false);  // stepped forward
     WaitNode* stepped = QueueAt(h.Now() + 3 * kSecond, true);
     ASSERT_EQ(gWaitList.load(), first);
-    SetOffset(2);
-    PassAt(h.Now() + 1500 * kMs);
-    EXPECT_NE(Fired(stepped), 0u) << "a stepped global node waited for the node before it";
-    EXPECT_EQ(Fired(first), 0u);
+    SetOffset(2), PassAt(h.Now() + 1500 * kMs);
+    EXPECT_EQ(std::tuple(Fired(stepped), Fired(first)), std::tuple(1u, 0u)) << "a stepped node waited for the one before it";
+}
+
+
+template <typename F>
+bool Within(uint64_t ms, F done) {  // polls `done` for up to `ms`
+    for (const uint64_t end = MonoNowNs() + ms * kMs; !done(); usleep(200)) if (MonoNowNs() > end) return false;
+    return true;
+}
+
+// A wait on a thread of its own; one given up on is ended as unloading does, else the process fails.
+class Waiter {
+public:
+    template <typename F>
+    explicit Waiter(F wait) : thread_([this, wait] { wait(), done_.store(true); }) {}
+    ~Waiter() { ReturnsWithin(0); }
+    bool ReturnsWithin(uint32_t ms) {
+        if (!thread_.joinable()) return true;
+        const bool returned = Within(ms, [this] { return done_.load(); });
+        if (!returned) gStopping.store(true), WakeBlockedWaiters();
+        if (!Within(2000, [this] { return done_.load(); })) std::fprintf(stderr, "unstoppable wait\n"), _exit(1);
+        thread_.join(), gStopping.store(false);
+        return returned;
+    }
+    std::atomic<bool> done_{false};
+    std::thread thread_;
+};
+
+uint64_t GlobalNow() { ClockTime g; return gEngine.load()->ReadGlobal6(g), ToU64(g); }
+uint64_t MonotonicNow() { ClockTime m; return gEngine.load()->ReadMonotonic0(m), ToU64(m); }
+uint32_t WaitOwn(uint64_t deadline, PalSemaphore* s = nullptr) {  // on the node's own semaphore by default
+    const ClockTime d = FromU64(deadline);
+    return quelta_iTSCEvent_Wait_Callback_C(s, &d, nullptr, nullptr, 0, nullptr);
+}
+
+class EventWaits : public Scheduler {
+protected:
+    void SetUp() override {
+        h.GiveNodesSemaphores();
+        ASSERT_EQ(PalSemaphoreCreate(&semaphore), 0);
+        gConvertStandInEnabled.store(true);  // the wall clock, converted for real: a waiter's own wake is on time
+        h.Pass();  // the first pass notes the generation
+    }
+    void TearDown() override { gGeneration.store(0), PalSemaphoreDestroy(semaphore), ResetSystemClockHooks(); }
+    PalSemaphore* semaphore = nullptr;
+};
+
+std::atomic<uint32_t> gRestoredGeneration{0};
+void RestoreGeneration(void*) { gGeneration.store(gRestoredGeneration.load()); }
+
+// Never early unless the result says why: a new generation ends a queued global wait with an abort flag
+// (flag 1); without a flag, or changed back before the waiter looks (by the pass's callback), it lasts.
+TEST_F(EventWaits, ANewGenerationEndsOnlyAnAbortableGlobalWait) {
+    const struct { bool flag, changedBack; uint64_t ahead; } rows[] = {
+        {true, false, 5000 * kMs}, {false, false, 150 * kMs}, {true, true, 150 * kMs}};
+    for (const auto& row : rows) {
+        SCOPED_TRACE(testing::Message() << row.flag << row.changedBack);
+        const uint32_t generation = gGeneration.load(), aborted = row.flag && !row.changedBack;
+        const uint64_t before = GlobalNow();
+        const ClockTime target = FromU64(before + row.ahead);
+        uint32_t abortFlag = 77;
+        ClockTime after{1, 2};
+        Waiter waiter([&] { quelta_iTSC_WaitUntilGlobalClocks64_C(&target, row.flag ? &abortFlag : nullptr, &after, generation); });
+        ASSERT_TRUE(Within(1000, [] { return gWaitList.load() != nullptr; })) << "the wait was not queued";
+        if (row.changedBack) {
+            gRestoredGeneration.store(generation), quelta_iTSC_SetCallback(&RestoreGeneration, nullptr);
+            const ClockTime now = FromU64(h.Now());
+            ASSERT_EQ(quelta_iTSC_SetCallbackTime(&now, 0), 1u);
+        }
+        gGeneration.store(generation + 1), h.SetNow(h.Now() + 1000), h.Pass();
+        quelta_iTSC_SetCallback(nullptr, nullptr);
+        ASSERT_TRUE(waiter.ReturnsWithin(2000)) << "the wait did not end";
+        EXPECT_EQ(abortFlag, row.flag ? aborted : 77u);
+        EXPECT_GE(ToU64(after), before);
+        EXPECT_EQ(ToU64(after) < ToU64(target), bool(aborted)) << "early, or late when aborted";
+        EXPECT_EQ(h.FreeNodes(), kWaitNodeCount);
+    }
+}
+
+// A monotonic waiter holds its node unqueued, waking by itself: a stray post on it does not end it early.
+TEST_F(EventWaits, AStrayPostDoesNotEndAMonotonicWaitEarly) {
+    const uint64_t deadline = MonotonicNow() + 100 * kMs;
+    uint32_t r = 99;
+    Waiter waiter([&] { r = WaitOwn(deadline); });
+    WaitNode* held = nullptr;
+    ASSERT_TRUE(Within(1000, [&] { for (WaitNode& n : h.pool) held = State(&n) == kHeld ? &n : held; return held != nullptr; }));
+    PalSemaphorePost(held->ownSemaphore.load());
+    ASSERT_TRUE(waiter.ReturnsWithin(2000));
+    EXPECT_EQ(std::tuple(r, MonoNowNs() >= deadline), std::tuple(0u, true)) << "ended early";
+}
+
+// Before the event system starts: abort flag 0xFFFFFFFF and no time written, or 3; none blocks.
+TEST_F(EventWaits, BeforeTheEventSystemStartsWaitsAreRefused) {
+    gEventSystemReady.store(0);
+    const ClockTime target = FromU64(GlobalNow() + 1000 * kMs);
+    uint32_t abortFlag = 5;
+    ClockTime after{1, 2};
+    const uint64_t t0 = MonoNowNs();
+    quelta_iTSC_WaitUntilGlobalClocks64_C(&target, &abortFlag, &after, gGeneration.load());
+    EXPECT_EQ(std::tuple(abortFlag, after.low, after.high), std::tuple(0xFFFFFFFFu, 1u, 2u));
+    EXPECT_EQ(std::tuple(quelta_iTSCEvent_Wait_C(semaphore, 1000), WaitOwn(ToU64(target), semaphore)), std::tuple(3u, 3u));
+    EXPECT_LT(MonoNowNs() - t0, 100 * kMs);
+    gEventSystemReady.store(1);
+}
+
+// High word 0xFFFFFFFF is before every time: at once. Centuries ahead (0xFFFFFFFE) and NeverTime
+// keep it waiting (until the stop ends it: 3, the node kept, as the pool goes with the library).
+TEST_F(EventWaits, DeadlinesAtTheEdgesOfTheOrderBoundABlockingWait) {
+    for (uint64_t at : {0xFFFFFFFF00000005ull, 0xFFFFFFFE00000005ull, 0xFFFFFFFEFFFFFFFFull}) {
+        SCOPED_TRACE(at);
+        const bool past = (at >> 32) == 0xFFFFFFFFu;
+        uint32_t r = 99;
+        Waiter waiter([&] { r = WaitOwn(at); });
+        EXPECT_EQ(waiter.ReturnsWithin(past ? 1000 : 100), past);
+        EXPECT_EQ(r, past ? 0u : 3u);
+        if (past) { EXPECT_EQ(h.FreeNodes(), kWaitNodeCount); }
+    }
+}
+
+// Over up to twenty tries `wait` never takes under `ms`, and some try under `ms + 1` (an extra
+// millisecond shows in every try, noise not).
+template <typename F>
+void ExpectMilliseconds(uint32_t ms, F wait) {
+    SCOPED_TRACE(testing::Message() << ms << " ms");
+    uint64_t least = ~uint64_t(0);
+    for (int i = 0; i < 20 && least >= (ms + 1) * kMs; ++i) {
+        uint64_t elapsed = 0;
+        Waiter timed([&] {
+            sched_param p{1};
+            pthread_setschedparam(pthread_self(), SCHED_FIFO, &p);  // where allowed: fewer late wakes
+            const uint64_t t0 = MonoNowNs();
+            wait(), elapsed = MonoNowNs() - t0;
+        });
+        ASSERT_TRUE(timed.ReturnsWithin(2000)) << "the wait does not end";
+        EXPECT_GE(elapsed, ms * kMs) << "early";
+        least = std::min(least, elapsed);
+    }
+    EXPECT_LT(least, (ms + 1) * kMs) << "a whole millisecond late in every try";
+}
+
+timespec gWallClock{1700000000, 250000000};  // a fixed global clock: the remaining time is exact
+int FixedWallClock(clockid_t id, timespec* ts) { return id == CLOCK_REALTIME ? (*ts = gWallClock, 0) : clock_gettime(id, ts); }
+
+// Without the tick service a global wait sleeps the remainder rounded to whole ms, plus one.
+TEST_F(EventWaits, WithoutTickServiceWaitsSleepWholeMillisecondsPlusOne) {
+    gEngine.load()->serviceMode.store(1), gSystemClock.getTime = &FixedWallClock;
+    const uint64_t now = GlobalNow();
+    for (auto [ahead, ms] : {std::pair{int64_t(2300000), 3u}, {int64_t(2600000), 4u}, {-int64_t(1000 * kMs), 0u}}) {
+        const ClockTime target = FromU64(now + static_cast<uint64_t>(ahead));
+        ExpectMilliseconds(ms, [&] {
+            uint32_t abortFlag = 7;
+            ClockTime after{1, 2};
+            quelta_iTSC_WaitUntilGlobalClocks64_C(&target, &abortFlag, &after, gGeneration.load());
+            EXPECT_EQ(std::tuple(abortFlag, ToU64(after)), std::tuple(0u, now));
+        });
+    }
+    // An event wait's timeout is cut to whole ms, plus one; 0xFFFFFFFF waits for a post; waits on the
+    // list are refused (3) and take no node.
+    for (auto [timeout, ms] : {std::pair{999u, 1u}, {1000u, 2u}, {0u, 1u}}) {
+        ExpectMilliseconds(ms, [&, timeout = timeout] { EXPECT_EQ(quelta_iTSCEvent_Wait_C(semaphore, timeout), 1u); });
+    }
+    std::atomic<uint32_t> r{99};
+    Waiter forever([&] { r.store(quelta_iTSCEvent_Wait_C(semaphore, 0xFFFFFFFFu)); });
+    EXPECT_FALSE(Within(30, [&] { return r.load() != 99u; })) << "no timeout, yet it ended";
+    PalSemaphorePost(semaphore);
+    EXPECT_TRUE(forever.ReturnsWithin(1000));
+    EXPECT_EQ(r.load(), 0u);
+    EXPECT_EQ(std::tuple(WaitOwn(MonotonicNow() + 20 * kMs), WaitOwn(MonotonicNow() + 20 * kMs, semaphore)), std::tuple(3u, 3u));
+    EXPECT_EQ(h.FreeNodes(), kWaitNodeCount);
 }
 
 }  // namespace
