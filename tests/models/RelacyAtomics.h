@@ -1,18 +1,11 @@
 // The atomics policy of tLinux/PalAtomic.h over Relacy's model of the C++
-// memory model, and the driver every model executable shares.
-//
-// A model instantiates the library's own hand-off templates with RlAtomics,
-// so Relacy explores the library's steps: every load may return any value
-// the memory model allows, and a plain variable (rl::var) read without a
-// happens-before edge from its write is reported as a data race.
-//
-// Include the library's headers BEFORE this one: Relacy defines macros
-// (memory_order_*, new, delete, errno, assert) that would rewrite them.
-//
-// Each ordered operation knows its call site in the library (__builtin_FILE
-// and __builtin_LINE, evaluated where the template calls the policy), so
-// `--weaken-each` can run the models once per site with that one order
-// weakened and tell whether some model catches it.
+// memory model, and the driver of the models. A model runs the library's own
+// hand-off templates over RlAtomics: every load may return any value the
+// memory model allows, and a plain rl::var read without a happens-before edge
+// from its write is a data race. Include the library's headers BEFORE this one
+// (Relacy's macros would rewrite them). Each ordered operation knows its call
+// site in the library (__builtin_FILE/LINE where the template calls the
+// policy), so `--weaken-each` can rerun the models with that one order weakened.
 #ifndef QUELTA_MODELS_RELACYATOMICS_H
 #define QUELTA_MODELS_RELACYATOMICS_H
 
@@ -25,10 +18,7 @@
 
 namespace models {
 
-// --- weakening one call site --------------------------------------------------
-
-// Nothing here allocates: Relacy replaces the global operator new with its
-// own, per simulation.
+// Nothing here allocates: Relacy's operator new belongs to each simulation.
 struct Site {
     const char* file;  // __builtin_FILE: static storage
     int line;
@@ -45,14 +35,10 @@ struct Weakening {
     const Site* weakened = nullptr;  // the site run weaker, and how
     rl::memory_order to = rl::mo_relaxed;
 };
-
-inline Weakening& Weak() {
-    static Weakening w;
-    return w;
-}
+inline Weakening gWeak;
 
 inline rl::memory_order At(rl::memory_order order, char kind, const char* file, int line) {
-    Weakening& w = Weak();
+    Weakening& w = gWeak;
     if (order == rl::mo_relaxed) return order;
     if (w.recording) {
         bool known = false;
@@ -62,8 +48,6 @@ inline rl::memory_order At(rl::memory_order order, char kind, const char* file, 
     return w.weakened != nullptr && w.weakened->Is(file, line, kind) ? w.to : order;
 }
 
-// --- the policy ---------------------------------------------------------------
-
 #define QUELTA_MODEL_SITE const char *file = __builtin_FILE(), int line = __builtin_LINE()
 
 struct RlAtomics {
@@ -71,11 +55,8 @@ struct RlAtomics {
     using Atomic = rl::atomic<T>;
     using Order = rl::memory_order;
 
-    static constexpr Order kRelaxed = rl::mo_relaxed;
-    static constexpr Order kAcquire = rl::mo_acquire;
-    static constexpr Order kRelease = rl::mo_release;
-    static constexpr Order kAcqRel = rl::mo_acq_rel;
-    static constexpr Order kSeqCst = rl::mo_seq_cst;
+    static constexpr Order kRelaxed = rl::mo_relaxed, kAcquire = rl::mo_acquire, kRelease = rl::mo_release,
+                           kAcqRel = rl::mo_acq_rel, kSeqCst = rl::mo_seq_cst;
     // The library's relaxed load kept in order by an address dependency: the
     // model reads it as consume (which Relacy treats as acquire).
     static constexpr Order kDependency = rl::mo_consume;
@@ -106,11 +87,8 @@ struct RlAtomics {
 
 #undef QUELTA_MODEL_SITE
 
-// --- the driver -----------------------------------------------------------------
-
-// A model and how far it is searched: every schedule with at most
-// `preemptions` switches away from a thread that could go on, and every
-// value each load may return in it.
+// A model, searched through every schedule with at most `preemptions`
+// switches away from a thread that could go on.
 struct Case {
     const char* name;
     bool (*run)(rl::test_params&);
@@ -122,14 +100,12 @@ bool Simulate(rl::test_params& params) {
     return rl::simulate<Test>(params);
 }
 
-// Discards what it is given, without allocating: Relacy writes its reports
-// from inside a simulation, where allocations belong to the simulation.
+// Discards Relacy's reports without allocating (they are written inside a simulation).
 struct NullBuffer : std::streambuf {
     int overflow(int c) override { return c; }
 };
 
-// Runs every case; unless quiet, the failing one's history goes to standard
-// output.
+// Runs every case; unless quiet, the failing one's history goes to standard output.
 inline const char* RunAll(const Case* cases, size_t n, bool quiet) {
     static NullBuffer nullBuffer;
     static std::ostream null(&nullBuffer);
@@ -142,8 +118,7 @@ inline const char* RunAll(const Case* cases, size_t n, bool quiet) {
         params.progress_stream = &null;
         if (!cases[i].run(params)) {
             if (!quiet) {
-                // Once more, reporting: the schedules are seeded by their
-                // number, so the same one fails again.
+                // Once more, reporting: schedules are seeded by number, so the same one fails.
                 std::printf("%s: FAILED\n", cases[i].name);
                 params.output_stream = &std::cout;
                 cases[i].run(params);
@@ -156,18 +131,16 @@ inline const char* RunAll(const Case* cases, size_t n, bool quiet) {
     return nullptr;
 }
 
-// Without arguments: runs every case, exit status 0 when all hold. With
-// --weaken-each: one line per ordered call site (file:line, kind, order) and
-// weaker order, naming the case that caught it, or "NOT caught".
+// Every case, status 0 when all hold; with --weaken-each one line per ordered
+// call site and weaker order, naming the case that caught it or "NOT caught".
 inline int RunModels(int argc, char** argv, const Case* cases, size_t n) {
     if (argc < 2 || std::strcmp(argv[1], "--weaken-each") != 0) return RunAll(cases, n, false) == nullptr ? 0 : 1;
-    Weakening& w = Weak();
+    Weakening& w = gWeak;
     w.recording = true;
     if (RunAll(cases, n, true) != nullptr) return 1;
     w.recording = false;
     for (size_t i = 0; i < w.count; ++i) {
-        // Relaxed, and for a sequentially consistent operation first the
-        // acquire/release order of its kind.
+        // Relaxed, and for a seq_cst operation first the acquire/release order of its kind.
         const Site& site = w.seen[i];
         const rl::memory_order paired = site.kind == 'l' ? rl::mo_acquire
                                         : site.kind == 's' ? rl::mo_release
