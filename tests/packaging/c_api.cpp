@@ -1,2 +1,1 @@
-// The same checks as c_api.c, compiled as C++: the headers work both ways.
-#include "c_api.c"
+#include "c_api.c"  // the same program as C++: the headers work both ways
