@@ -9,10 +9,12 @@
 // The timer thread must not wait for callers, and a caller holding the lock
 // may have been preempted, so a pass takes the lock as seldom as it can: the
 // clock reading and both conversions are made before it, and one hold serves
-// the tick, both callback times, the expired nodes and the arming. Only a
-// pass that has something to call (a callback, a node to post, the tick
-// callback) leaves the lock for the calls and takes it once more to settle
-// the fired nodes and arm.
+// the tick, the callback times' folding, the expired nodes and the arming.
+// A due callback time is claimed and its callback made before the lock is
+// taken at all, so a caller inside the lock never delays a callback. Only a
+// pass that has something else to call (a node to post, the tick callback, a
+// callback time set due meanwhile) leaves the lock for the calls and takes it
+// once more to settle the fired nodes and arm.
 #include "engine/TickService.h"
 
 #include "engine/ClockTimeOps.h"
@@ -51,6 +53,16 @@ void CallCallback(const ClockTime* now) {
     fn(arg != nullptr ? arg : const_cast<ClockTime*>(now));
 }
 
+// Claims a callback time that is due (NeverTime takes its place, so the
+// callback may set the next one) and makes the callback. Needs no lock: the
+// claim is one exchange against the time read, and a caller that changed the
+// time meanwhile makes it fail; the locked part of the pass then looks again.
+bool FireIfDue(AtomicClockTime& cell, uint64_t time, bool due, const ClockTime* nowTime) {
+    if (!due || !cell.CompareExchange(time, kNeverTime64)) return false;
+    CallCallback(nowTime);
+    return true;
+}
+
 void FoldIntoNextDeadline(uint64_t t) {
     uint64_t d = gNextDeadline.Load();
     Fold(t, d);
@@ -80,8 +92,7 @@ bool ServeTickLocked(tKPusTimingEngine* engine, uint64_t now) {
 // What one pass found to do outside the lock.
 struct PassWork {
     bool tickDue = false;
-    bool callMonotonic = false;  // the monotonic callback time was due
-    bool callGlobal = false;     // the global callback time was due
+    bool callMonotonic = false;  // the monotonic callback time was set due meanwhile
     bool repeat = false;         // the global callback time changed under us
     uint32_t fired = 0;
     WaitNode* batch[kWaitNodeCount];
@@ -118,22 +129,28 @@ void TickServiceRoutine() {
 
     PassWork work;
     for (;;) {
-        // Before the lock: the reading, its global equivalent, and the global
+        // Before the lock: the reading, the due callbacks (with the pass's
+        // monotonic now), the reading's global equivalent, and the global
         // callback time on the monotonic clock (NeverTime cancels: it is
         // neither converted nor folded). The global clock is consulted only
         // while something waits on it, so a pass at rest (the tick alone)
         // makes no conversion.
-        const uint64_t globalTime = gGlobalCallbackTime.Load();
-        const bool needGlobal = !IsNever(globalTime) || GlobalNodesQueued();
         const uint64_t now = ReadNow(engine);
         const ClockTime nowTime = FromU64(now);
+        const uint64_t callbackTime = gMonotonicCallbackTime.Load();
+        FireIfDue(gMonotonicCallbackTime, callbackTime, Due(callbackTime, now), &nowTime);
+        const uint64_t globalTime = gGlobalCallbackTime.Load();
+        const bool needGlobal = !IsNever(globalTime) || GlobalNodesQueued();
         const uint64_t nowGlobal = needGlobal ? ToU64(slots->MonotonicToGlobal(nowTime)) : now;
         const int64_t offset = GlobalOffsetOf(now, nowGlobal);
+        // The global callback time is compared on the global clock, so that
+        // a step of the wall clock moves it along.
         const bool globalDue = Due(globalTime, nowGlobal);
+        const bool globalFired = FireIfDue(gGlobalCallbackTime, globalTime, globalDue, &nowTime);
         uint64_t globalAsMonotonic = kNeverTime64;
         if (!globalDue && !IsNever(globalTime)) globalAsMonotonic = ToU64(slots->GlobalToMonotonic(FromU64(globalTime)));
 
-        work.callMonotonic = work.callGlobal = work.repeat = false;
+        work.callMonotonic = work.repeat = false;
         work.fired = 0;
         {
             SchedLockGuard lock;
@@ -141,8 +158,8 @@ void TickServiceRoutine() {
             gNextDeadline.Store(kNeverTime64);
             work.tickDue = ServeTickLocked(engine, now);
 
-            // A due callback time is replaced by NeverTime before its
-            // callback runs, so the callback may set the next one.
+            // A monotonic callback time set meanwhile may be due already; it
+            // is claimed here and called after the lock.
             const uint64_t monotonicTime = gMonotonicCallbackTime.Load();
             if (Due(monotonicTime, now)) {
                 gMonotonicCallbackTime.Store(kNeverTime64);
@@ -150,14 +167,9 @@ void TickServiceRoutine() {
             } else {
                 FoldIntoNextDeadline(monotonicTime);
             }
-            // The global callback time is compared on the global clock, so
-            // that a step of the wall clock moves it along.
-            if (gGlobalCallbackTime.Load() != globalTime) {
+            if (gGlobalCallbackTime.Load() != (globalFired ? kNeverTime64 : globalTime)) {
                 work.repeat = true;  // set meanwhile: look again with its conversion
-            } else if (globalDue) {
-                gGlobalCallbackTime.Store(kNeverTime64);
-                work.callGlobal = true;
-            } else {
+            } else if (!globalDue) {
                 FoldIntoNextDeadline(globalAsMonotonic);
             }
 
@@ -171,16 +183,15 @@ void TickServiceRoutine() {
             work.fired += DetachDueNodesLocked(now, offset, work.batch + work.fired, kWaitNodeCount - work.fired);
 
             const bool tickCallback = work.tickDue && gTickCallback.load(kRelaxed) != nullptr;
-            if (!work.callMonotonic && !work.callGlobal && work.fired == 0 && !tickCallback && !work.repeat) {
+            if (!work.callMonotonic && work.fired == 0 && !tickCallback && !work.repeat) {
                 if (ArmNextLocked()) return;
                 continue;
             }
         }
 
-        // The calls, without the lock: the callback for each due callback
-        // time (with the pass's monotonic now), the expired nodes, the tick.
+        // The calls, without the lock: the callback for a monotonic callback
+        // time set due meanwhile, the expired nodes, the tick.
         if (work.callMonotonic) CallCallback(&nowTime);
-        if (work.callGlobal) CallCallback(&nowTime);
         for (uint32_t i = 0; i < work.fired; ++i) work.release[i] = RunFiring(work.batch[i]);
         if (work.tickDue) {
             QueltaTickCallbackFn tick = TakeTickCallback<StdAtomics>(gTickCallback);

@@ -68,15 +68,16 @@ tick.jitter-sample @@ engine/TickService.cpp @@ static_cast<uint32_t>(now - next
 tick.replay-missed @@ engine/TickService.cpp @@ if (Earlier(nextTick, now)) nextTick = now; @@ (void)0;
 tick.period-twice @@ engine/TickService.cpp @@ nextTick += gTickPeriod.Load(); @@ nextTick += 2 * gTickPeriod.Load();
 tick.deadline-not-tick @@ engine/TickService.cpp @@     gNextDeadline.Store(gNextTick.Load());<NL>    return tickDue; @@     return tickDue;
-tick.monotonic-due-strict @@ engine/TickService.cpp @@ if (Due(monotonicTime, now)) { @@ if (Earlier(monotonicTime, now)) {
-tick.monotonic-kept @@ engine/TickService.cpp @@                 gMonotonicCallbackTime.Store(kNeverTime64);<NL> @@ <NL>
+tick.monotonic-due-strict @@ engine/TickService.cpp @@ Due(callbackTime, now), &nowTime); @@ Earlier(callbackTime, now), &nowTime);
+tick.monotonic-kept @@ engine/TickService.cpp @@ if (!due || !cell.CompareExchange(time, kNeverTime64)) return false; @@ if (!due) return false;
 tick.global-never-converted @@ engine/TickService.cpp @@ if (!globalDue && !IsNever(globalTime)) globalAsMonotonic @@ if (!globalDue) globalAsMonotonic
 tick.global-due-strict @@ engine/TickService.cpp @@ const bool globalDue = Due(globalTime, nowGlobal); @@ const bool globalDue = Earlier(globalTime, nowGlobal);
 tick.global-not-folded @@ engine/TickService.cpp @@                 FoldIntoNextDeadline(globalAsMonotonic); @@                 (void)globalAsMonotonic;
 tick.monotonic-not-folded @@ engine/TickService.cpp @@                 FoldIntoNextDeadline(monotonicTime); @@                 (void)monotonicTime;
 tick.generation-ignored @@ engine/TickService.cpp @@ work.fired = DetachAbortableGlobalNodesLocked(work.batch, kWaitNodeCount); @@ work.fired = 0;
 tick.generation-forgotten @@ engine/TickService.cpp @@                 sLastGeneration.store(generation, kRelaxed);<NL> @@ <NL>
-tick.global-callback-lost @@ engine/TickService.cpp @@ if (work.callGlobal) CallCallback(&nowTime); @@ (void)0;
+tick.global-callback-lost @@ engine/TickService.cpp @@ const bool globalFired = FireIfDue(gGlobalCallbackTime, globalTime, globalDue, &nowTime); @@ const bool globalFired = false;
+tick.callback-waits-for-lock @@ engine/TickService.cpp @@ if (!due || !cell.CompareExchange(time, kNeverTime64)) return false;<NL>    CallCallback(nowTime); @@ if (!due || !cell.CompareExchange(time, kNeverTime64)) return false;<NL>    { SchedLockGuard waited; }<NL>    CallCallback(nowTime);
 tick.serial-stuck @@ engine/TickService.cpp @@ sTickSerial.fetch_add(1, kRelaxed); @@ (void)0;
 tick.argument-ignored @@ engine/TickService.cpp @@ fn(arg != nullptr ? arg : const_cast<ClockTime*>(now)); @@ fn(const_cast<ClockTime*>(now));
 # --- wait list (engine/WaitList.cpp) ---
