@@ -1,7 +1,5 @@
-/* <quelta/quelta.h> and <quelta/version.h> as C11 (and as C++: c_api.cpp),
- * pedantic and warning-free, in a program linked against libquelta: the
- * version macros name this version, a deadline takes a callback written in
- * C, and a plain wait is not early. Prints OK. (c_strict.c: plain C11.) */
+/* The public headers as C11 (c_api.cpp: as C++), pedantic, in a linked program: version macros, a C callback,
+ * a plain wait not early. Prints OK. (c_strict.c: plain C11.) */
 #ifndef _XOPEN_SOURCE
 #define _XOPEN_SOURCE 700
 #endif

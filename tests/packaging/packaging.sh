@@ -1,7 +1,4 @@
-# The packaging checks, one per ctest test: packaging.sh install_tree |
-# debian_packages | lintian. The test's CMake registration passes
-# the build's facts in the environment (see tests/packaging/CMakeLists.txt).
-# With pipefail, never `cmd | grep -q` (grep's early exit fails the pipe).
+# packaging.sh install_tree|debian_packages|lintian, the build's facts in the environment (CMakeLists.txt). With pipefail, never `cmd | grep -q`.
 set -euo pipefail
 MAJOR=${VERSION%%.*}
 HERE=$(cd "$(dirname "${BASH_SOURCE[0]}")" && pwd)
@@ -18,8 +15,7 @@ expect_list() {  # what expected-lines found-lines
 run_quiet() { "$@" >"$SCRATCH/log" 2>&1 || { echo "FAIL: command failed: $*"; cat "$SCRATCH/log"; exit 1; }; }
 soname_of() { readelf -d "$1" | sed -n 's/.*(SONAME).*\[\(.*\)\].*/\1/p'; }
 tree_of() { (cd "$1" && find . \( -type f -o -type l \) | sed 's|^\./||'); }
-# What each part installs, relative to the prefix (targets file per config
-# written as CONFIG), and Debian's own files in package $1.
+# What each part installs under the prefix (per-config targets file as CONFIG); Debian's files in package $1.
 runtime_files() { printf '%s\n' "$LIBDIR/libquelta.so.$MAJOR" "$LIBDIR/libquelta.so.$VERSION"; }
 dev_files() {
   (cd "$SOURCE_DIR/include" && find quelta -type f -name '*.h' | sed "s|^|$INCLUDEDIR/|")
@@ -31,8 +27,7 @@ dev_files() {
 tools_files() { [ "${HAS_PROBE:-0}" != 1 ] || printf '%s\n' "$BINDIR/quelta-probe" "$MANDIR/man1/quelta-probe.1.gz"; }
 debian_files() { printf '%s\n' "$DATAROOTDIR/doc/$1/changelog.Debian.gz" "$DATAROOTDIR/doc/$1/copyright" "$DATAROOTDIR/lintian/overrides/$1"; }
 config() { sed 's|/quelta-targets-[a-z]*\.cmake$|/quelta-targets-CONFIG.cmake|'; }
-# Program $3 loads libquelta.so.6 from $2 (natively: asked of the loader)
-# and runs: prints OK, not early.
+# Program $3 loads libquelta.so.6 from $2 (natively: asked of the loader) and prints OK.
 runs_from() {
   [ -n "${RUN_WITH:-}" ] || expect_eq "$1 loads the library from $2" "$(LD_TRACE_LOADED_OBJECTS=1 LD_LIBRARY_PATH="$2" "$3" \
     | sed -n 's/.*libquelta\.so\.[0-9]* => \([^ ]*\).*/\1/p')" "$2/libquelta.so.$MAJOR"
@@ -42,7 +37,6 @@ consumer_runs() {  # what lib pkg-config-flags
   run_quiet "$CXX" -std=c++17 -Wall -Wextra -Wpedantic -Werror -DQUELTA_EXPECTED_VERSION="\"$VERSION\"" "$HERE/c_api.cpp" $3 ${EXE_LDFLAGS:-} -o "$SCRATCH/$1"
   runs_from "$1" "$2" "$SCRATCH/$1"
 }
-# The packages cpack -G DEB makes (the tools one when the probe is built).
 debs=("libquelta6" "libquelta-dev")
 [ "${HAS_PROBE:-0}" = 1 ] && debs+=("quelta-tools")
 deb_of() { echo "$SCRATCH/debs/${1}_${DEB_VERSION}_${DEB_ARCH}.deb"; }
@@ -53,16 +47,13 @@ make_debs() {
   [ "$failures" = 0 ] || exit 1
 }
 
-# cmake --install lays out a system library and nothing else: the real file
-# with the full version and its two links, no run path, the source's public
-# headers unchanged, version.h, quelta.pc naming the prefix.
+# cmake --install lays out the library (file, two links, no run path), the headers unchanged, version.h, quelta.pc, nothing else.
 install_tree() {
   local prefix="$SCRATCH/prefix" lib="$SCRATCH/prefix/$LIBDIR"
   run_quiet "$CMAKE" --install "$BUILD_DIR" --prefix "$prefix"
   expect_list "installed tree" "$(runtime_files; dev_files; tools_files)" "$(tree_of "$prefix" | config)"
-  check "libquelta.so.$VERSION is a regular file" "[ -f '$lib/libquelta.so.$VERSION' ] && [ ! -L '$lib/libquelta.so.$VERSION' ]"
-  expect_eq "soname" "$(soname_of "$lib/libquelta.so.$VERSION")" "libquelta.so.$MAJOR"
-  expect_eq "links" "$(readlink "$lib/libquelta.so.$MAJOR") $(readlink "$lib/libquelta.so")" "libquelta.so.$VERSION libquelta.so.$MAJOR"
+  expect_eq "library file, soname, links" "$(stat -c %F "$lib/libquelta.so.$VERSION") $(soname_of "$lib/libquelta.so.$VERSION") $(readlink \
+    "$lib/libquelta.so.$MAJOR") $(readlink "$lib/libquelta.so")" "regular file libquelta.so.$MAJOR libquelta.so.$VERSION libquelta.so.$MAJOR"
   check "no run path" "! readelf -d '$lib/libquelta.so.$VERSION' | grep -E 'RPATH|RUNPATH' >/dev/null"
   check "headers unchanged" "(cd '$SOURCE_DIR/include' && find quelta -name '*.h' | while read -r h; do cmp \"\$h\" '$prefix/$INCLUDEDIR/'\"\$h\" || exit 1; done)"
   expect_eq "version.h" "$(sed -n 's/^#define QUELTA_VERSION_STRING "\(.*\)"$/\1/p' "$prefix/$INCLUDEDIR/quelta/version.h")" "$VERSION"
@@ -104,9 +95,7 @@ CMAKE
     "$VERSION $prefix/$INCLUDEDIR $lib/libquelta.so.$VERSION libquelta.so.$MAJOR v-NOTFOUND"
 }
 
-# cpack makes the three packages with the right fields and computed
-# dependencies, symbols, the ldconfig trigger and no maintainer scripts,
-# each file in its package; unpacked together they give a usable library.
+# cpack's three packages: fields, computed dependencies, symbols, ldconfig trigger, files; unpacked, a usable library.
 debian_packages() {
   make_debs
   local root="$SCRATCH/root" lib="$SCRATCH/root/usr/$LIBDIR" c="$SCRATCH/control" ver=${DEB_VERSION//./\\.} v=' \([<>=]+ [^)]+\)'
@@ -132,8 +121,8 @@ debian_packages() {
     expect_eq "$p changelog's newest entry" "$(dpkg-parsechangelog -l "$SCRATCH/changelog" -S Version)" "$DEB_VERSION"
   done
   dpkg-deb -e "$(deb_of libquelta6)" "$c"
-  expect_eq "shlibs" "$(cat "$c/shlibs")" "libquelta $MAJOR libquelta6 (>= $VERSION)"
-  expect_eq "symbols header" "$(head -1 "$c/symbols")" "libquelta.so.$MAJOR libquelta6 #MINVER#"
+  expect_eq "shlibs, symbols header" "$(cat "$c/shlibs"; head -1 "$c/symbols")" "libquelta $MAJOR libquelta6 (>= $VERSION)
+libquelta.so.$MAJOR libquelta6 #MINVER#"
   expect_list "symbols file lists the library's exports" \
     "$(readelf --dyn-syms -W "$lib/libquelta.so.$VERSION" | awk '$7 != "UND" && $7 != "Ndx" && $8 != "" && ($5 == "GLOBAL" || $5 == "WEAK") {print $8}' | sed 's/@.*//' | sort -u)" \
     "$(sed -n 's/^ \([^@ ]*\)@Base [0-9].*/\1/p' "$c/symbols")"
@@ -148,9 +137,7 @@ debian_packages() {
     "$(PKG_CONFIG_SYSROOT_DIR="$root" PKG_CONFIG_LIBDIR="$lib/pkgconfig" PKG_CONFIG_PATH="" pkg-config --cflags --libs quelta)"
 }
 
-# lintian passes the packages with no error and no warning, and no hardening
-# tag among the informational ones; overrides live in the packages, each
-# with a comment that proves it right (cmake/debian/lintian-overrides.in).
+# lintian: no error, no warning, no hardening tag (overrides in cmake/debian/lintian-overrides.in, each proved there).
 lintian_clean() {
   make_debs
   local rc=0
