@@ -1,22 +1,20 @@
 // The emulated kernel extension the kext tests run the library on. Before any
-// test (and so before any thread) the process takes a private mount namespace
-// with a tmpfs over /sys/kernel for the two sysfs files, forks a supervisor
-// and installs a seccomp filter whose listener the supervisor holds; every
-// thread made afterwards (the timer thread among them) is served by it.
-// Where the machine refuses any of that, every test skips with one line.
-//
-// The supervisor serves the calls with the harshest semantics a kernel could
-// plausibly have:
+// test (and any thread) the process takes a private mount namespace with a
+// tmpfs over /sys/kernel for the two sysfs files, forks a supervisor and
+// installs a seccomp filter whose listener the supervisor holds; every thread
+// made afterwards (the timer thread among them) is served by it. Where the
+// machine refuses any of that, every test skips with one line. The supervisor
+// (single-threaded, after fork only system calls and snprintf) serves the
+// calls with the harshest semantics a kernel could plausibly have:
 // - sched_wake_up(tid) ends that timer thread's emulated sleep with -EAGAIN;
 //   a wake for a timer thread not asleep at that moment is lost.
 // - clock_converttime(from, to, ts) converts in place in the caller's own
-//   timespec layout, CLOCK_REALTIME moved by the skew knob; an unknown clock,
-//   a bad pointer or a result the layout cannot hold fails, ts untouched.
+//   timespec layout, CLOCK_REALTIME moved by the skew knob; an unknown clock
+//   or a result the layout cannot hold fails, ts untouched.
 // - A timer thread's clock_nanosleep on CLOCK_MONOTONIC is answered 0 at its
 //   deadline or -EAGAIN on a wake; other sleeps go to the real kernel. A
 //   sleep whose thread took a signal is dropped (the thread sees EINTR).
 // - Read-only opens of the two sysfs files are counted and let through.
-// After fork it is single-threaded and calls only system calls and snprintf.
 #ifndef QUELTA_TESTS_KEXT_KEXT_H
 #define QUELTA_TESTS_KEXT_KEXT_H
 
@@ -67,8 +65,7 @@ enum Counter : int {
     kConvertMonoToReal, kConvertRealToMono, kConvertOther, kConvertRefused,
     kConvertByCallers,                        // served for threads other than a timer thread
     kOpensWakeFile, kOpensConvertFile,        // read-only opens of the sysfs files
-    kTimerSleeps, kSleepsInterrupted,         // a timer thread's emulated sleeps; those a signal ended
-    kCounterCount
+    kTimerSleeps, kSleepsInterrupted, kCounterCount  // a timer thread's emulated sleeps; those a signal ended
 };
 using Counts = std::array<int64_t, kCounterCount>;
 
@@ -88,6 +85,11 @@ struct SharedPage {
         Counts c{};
         for (int i = 0; i < kCounterCount; ++i) c[i] = counters[i].load(std::memory_order_relaxed);
         return c;
+    }
+    Counts Since(const Counts& before) const {
+        Counts d = Snapshot();
+        for (int i = 0; i < kCounterCount; ++i) d[i] -= before[i];
+        return d;
     }
     void Add(Counter c) { counters[c].fetch_add(1, std::memory_order_relaxed); }
 };
@@ -131,11 +133,7 @@ public:
     }
 
 private:
-    struct Sleep {
-        int tid = 0;  // 0: slot free
-        uint64_t id = 0;
-        int64_t deadline = 0, arrived = 0;
-    };
+    struct Sleep { int tid = 0; uint64_t id = 0; int64_t deadline = 0, arrived = 0; };  // tid 0: slot free
 
     bool Reply(uint64_t id, int64_t val, int32_t error, uint32_t flags = 0) {
         seccomp_notif_resp r{id, val, error, flags};
@@ -388,16 +386,16 @@ public:
         if (child == 0) RunSupervisor(sv[1], parent);
         close(sv[1]);
         prctl(PR_SET_PTRACER, child);  // lets it read and write this process's memory under Yama
-        const int listener = InstallFilter();
+        std::vector<sock_filter> filter = FilterProgram();
+        sock_fprog prog{static_cast<unsigned short>(filter.size()), filter.data()};
+        prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0);  // else only with CAP_SYS_ADMIN
+        const int listener = int(syscall(SYS_seccomp, SECCOMP_SET_MODE_FILTER, SECCOMP_FILTER_FLAG_NEW_LISTENER, &prog));
         if (listener < 0) {
             kill(child, SIGKILL);
             return Fail("a seccomp user-notification filter", errno);
         }
-        FdMessage m;  // the listener, as SCM_RIGHTS
-        *CMSG_FIRSTHDR(&m.msg) = cmsghdr{CMSG_LEN(sizeof(int)), SOL_SOCKET, SCM_RIGHTS};
-        std::memcpy(CMSG_DATA(CMSG_FIRSTHDR(&m.msg)), &listener, sizeof listener);
-        char ack = 0;
-        const bool served = sendmsg(sv[0], &m.msg, 0) == 1 && read(sv[0], &ack, 1) == 1;
+        char ack = 0;  // the supervisor takes the listener with pidfd_getfd, then answers
+        const bool served = write(sv[0], &listener, sizeof listener) == sizeof listener && read(sv[0], &ack, 1) == 1;
         close(listener);
         close(sv[0]);
         if (!served) return Fail("the supervisor did not start", 0);
@@ -408,30 +406,13 @@ public:
 private:
     void Fail(const char* what, int err) { why_ = std::string(what) + (err ? std::string(" failed: ") + std::strerror(err) : ""); }
 
-    static int InstallFilter() {
-        std::vector<sock_filter> p = FilterProgram();
-        sock_fprog prog{static_cast<unsigned short>(p.size()), p.data()};
-        long fd = syscall(SYS_seccomp, SECCOMP_SET_MODE_FILTER, SECCOMP_FILTER_FLAG_NEW_LISTENER, &prog);
-        if (fd < 0 && errno == EACCES && prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0) {
-            fd = syscall(SYS_seccomp, SECCOMP_SET_MODE_FILTER, SECCOMP_FILTER_FLAG_NEW_LISTENER, &prog);
-        }
-        return static_cast<int>(fd);
-    }
-
-    struct FdMessage {  // one byte carrying one descriptor
-        char data = 'L';
-        iovec iov{&data, 1};
-        alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-        msghdr msg{nullptr, 0, &iov, 1, control, sizeof control, 0};
-    };
-
     [[noreturn]] void RunSupervisor(int socket, pid_t parent) {
         prctl(PR_SET_PDEATHSIG, SIGKILL);
         if (getppid() != parent) _exit(0);
-        FdMessage m;
-        int listener;
-        if (recvmsg(socket, &m.msg, 0) != 1 || CMSG_FIRSTHDR(&m.msg) == nullptr) _exit(1);
-        std::memcpy(&listener, CMSG_DATA(CMSG_FIRSTHDR(&m.msg)), sizeof listener);
+        int theirs = -1;
+        if (read(socket, &theirs, sizeof theirs) != sizeof theirs) _exit(1);
+        const int listener = static_cast<int>(syscall(SYS_pidfd_getfd, syscall(SYS_pidfd_open, parent, 0), theirs, 0));
+        if (listener < 0) _exit(1);
         sched_param p{};
         p.sched_priority = sched_get_priority_max(SCHED_FIFO);
         sched_setscheduler(0, SCHED_FIFO, &p);  // when allowed: wakes and deadlines are served first

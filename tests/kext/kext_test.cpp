@@ -15,23 +15,9 @@
 namespace kext {
 namespace {
 
-using testsupport::CT;
-using testsupport::LoadedLibrary;
-using testsupport::MonoNowNs;
-using testsupport::U64;
+using namespace testsupport;
 
 constexpr uint64_t kLoose = 100 * kMs;  // lateness is benchmarked, not asserted tightly
-
-// The counters' change since it was made.
-struct Delta {
-    SharedPage& page;
-    Counts before = page.Snapshot();
-    Counts operator()() const {
-        Counts d = page.Snapshot();
-        for (int i = 0; i < kCounterCount; ++i) d[i] -= before[i];
-        return d;
-    }
-};
 
 // A callback `delay` from now (its deadline stored); the time it ran, or 0 when not within 2 s.
 uint64_t CallbackAfter(LoadedLibrary& lib, uint64_t delay, uint64_t& deadline) {
@@ -40,12 +26,10 @@ uint64_t CallbackAfter(LoadedLibrary& lib, uint64_t delay, uint64_t& deadline) {
     deadline = MonoNowNs() + delay;
     const ClockTime when = CT(deadline);
     lib.api().SetCallbackTime(&when, 0);
-    const uint64_t end = testsupport::AwaitNonZero(firedAt, 2 * kSec);
+    const uint64_t end = AwaitNonZero(firedAt, 2 * kSec);
     lib.api().SetCallback(nullptr, nullptr);
     return end;
 }
-
-// --- start-up and unload ---------------------------------------------------------
 
 // In this order: a load after an unload is a new start-up, so a file that held
 // no usable number (0 among them) is read again at the next one.
@@ -53,8 +37,12 @@ struct FileCase {
     const char *name, *wake, *convert;  // the files' contents; nullptr: no file
     bool used;
 } const kFileCases[] = {
-    {"missing", nullptr, nullptr, false},   {"numbers", "917\n", "918\n", true}, {"zero", "0\n", "0\n", false},
-    {"numbers after zero", "917", "918", true}, {"negative", "-917\n", "-918\n", false}, {"empty", "", "", false},
+    {"missing", nullptr, nullptr, false},
+    {"numbers", "917\n", "918\n", true},
+    {"zero", "0\n", "0\n", false},
+    {"numbers after zero", "917", "918", true},
+    {"negative", "-917\n", "-918\n", false},
+    {"empty", "", "", false},
     {"garbage", "zq917\n", "x918\n", false},
 };
 
@@ -66,7 +54,7 @@ TEST_F(KextStartup, EachFileIsReadOncePerStartUpAndOnlyANumberAboveZeroIsUsed) {
         SCOPED_TRACE(c.name);
         Sandbox::WriteFile(kWakeFile, c.wake);
         Sandbox::WriteFile(kConvertFile, c.convert);
-        const Delta delta{Page()};
+        const Counts before = Page().Snapshot();
         int64_t shiftSeen = 0, epoch = 0;
         Counts d{};  // up to the unload, whose own wake call is left out
         {
@@ -77,7 +65,7 @@ TEST_F(KextStartup, EachFileIsReadOncePerStartUpAndOnlyANumberAboveZeroIsUsed) {
             const uint64_t m = MonoNowNs();
             shiftSeen = static_cast<int64_t>(U64(lib.engine()->MonotonicToGlobal(CT(m))) - m);
             epoch = EpochOffsetNs(lib.engine());
-            d = delta();
+            d = Page().Since(before);
         }
         void* still = dlopen(QUELTA_SO_PATH, RTLD_NOW | RTLD_NOLOAD);
         EXPECT_EQ(still, nullptr) << "the unload left the library mapped: no new start-up follows";
@@ -111,11 +99,9 @@ TEST_F(KextStartup, TwentyLoadUnloadCyclesEndPromptly) {
         lib.reset();
         worst = std::max(worst, MonoNowNs() - start);
     }
-    std::printf("slowest of 20 unloads: %.2f ms\n", worst / 1e6);
     EXPECT_LT(worst, 500 * kMs);
 }
 
-// --- sched_wake_up ---------------------------------------------------------------
 
 using KextWake = KextTest;
 
@@ -124,9 +110,9 @@ using KextWake = KextTest;
 TEST_F(KextWake, BetweenTickDeadlinesAreNeverEarlyAndTheWakesArriveThroughTheCall) {
     LoadedLibrary lib;
     ASSERT_TRUE(lib.ok()) << lib.error();
-    PalSemaphore* s = testsupport::NewRuntimeSemaphore();
+    PalSemaphore* s = NewRuntimeSemaphore();
     const char* const kinds[] = {"callback", "queued node", "event timeout", "microsecond wait"};
-    const Delta delta{Page()};
+    const Counts before = Page().Snapshot();
     uint64_t worst = 0;
     for (int round = 0; round < 4; ++round) {
         for (uint64_t delay : {300 * kUs, 1300 * kUs, 2700 * kUs}) {
@@ -147,13 +133,11 @@ TEST_F(KextWake, BetweenTickDeadlinesAreNeverEarlyAndTheWakesArriveThroughTheCal
             }
         }
     }
-    const Counts d = delta();
-    std::printf("48 deadlines between ticks: worst lateness %.0f us; wakes delivered %lld, lost %lld\n", worst / 1e3,
-                static_cast<long long>(d[kWakesDelivered]), static_cast<long long>(d[kWakesLost]));
+    const Counts d = Page().Since(before);
     EXPECT_LT(worst, kLoose);
     EXPECT_GT(d[kWakesDelivered], 0) << "no wake reached the sleeping timer thread";
     EXPECT_EQ(d[kWakesUnknownTid], 0) << "wakes sent to a thread that is no timer thread";
-    testsupport::DeleteRuntimeSemaphore(s);
+    DeleteRuntimeSemaphore(s);
 }
 
 // The call either works (no warning, no signal) or answers 38: then the
@@ -165,7 +149,7 @@ TEST_P(KextWakeFallback, WarningOnceAndSigalrmOnEachWakeOnlyWhenTheCallAnswers38
     const bool answers38 = GetParam();
     Page().wakeReturnsEnosys.store(answers38 ? 1 : 0);
     testing::internal::CaptureStdout();  // nothing may fail an assertion until it is taken
-    const Delta delta{Page()};
+    const Counts before = Page().Snapshot();
     Counts d{};
     int served = 0;
     uint64_t worst = 0;
@@ -175,7 +159,7 @@ TEST_P(KextWakeFallback, WarningOnceAndSigalrmOnEachWakeOnlyWhenTheCallAnswers38
             if ((end = CallbackAfter(lib, 100 * kUs + (served * 23 % 200) * kUs, deadline)) == 0) break;
             worst = std::max(worst, end - deadline);
         }
-        d = delta();  // the unload's own wake call left out
+        d = Page().Since(before);  // the unload's own wake call left out
     }
     const std::string text = testing::internal::GetCapturedStdout();
     EXPECT_EQ(served, 30) << "callbacks between ticks stopped being served";
@@ -215,7 +199,7 @@ TEST_P(KextWindow, ADeadlineSetInTheWindowIsServedWithinATick) {
     Counts d{};
     std::vector<uint64_t> late;
     for (int load = 0; load < 3; ++load) {
-        const Delta delta{Page()};
+        const Counts before = Page().Snapshot();
         LoadedLibrary lib;
         ASSERT_TRUE(lib.ok()) << lib.error();
         for (int i = 0; i < 100; ++i) {
@@ -226,14 +210,11 @@ TEST_P(KextWindow, ADeadlineSetInTheWindowIsServedWithinATick) {
             EXPECT_GE(end, deadline);
             late.push_back(end - deadline);
         }
-        const Counts part = delta();  // the unload's wake left out
+        const Counts part = Page().Since(before);  // the unload's wake left out
         for (int i = 0; i < kCounterCount; ++i) d[i] += part[i];
     }
     std::sort(late.begin(), late.end());
     const uint64_t median = late[late.size() / 2], worst = late.back();
-    std::printf("window [%s]: %zu deadlines, %lld wakes lost, %lld delivered, lateness median %.0f us, worst %.0f us\n",
-                c.name, late.size(), static_cast<long long>(d[kWakesLost]), static_cast<long long>(d[kWakesDelivered]),
-                median / 1e3, worst / 1e3);
     EXPECT_GT(d[c.hit], 0) << "the sweep never met the case";
     // A lost wake costs a tick: the worst with a loose margin for the machine's spikes, typically within two.
     EXPECT_LT(worst, 1 * kMs + 50 * kMs);
@@ -245,23 +226,17 @@ INSTANTIATE_TEST_SUITE_P(Knobs, KextWindow,
                                            WindowCase{"LateWakes", 0, 0, 1, kWakesEchoed}),
                          [](const testing::TestParamInfo<WindowCase>& p) { return p.param.name; });
 
-// --- clock_converttime, CLOCK_REALTIME 7 s ahead or behind -----------------------
 
-class KextGlobal : public KextTest, public ::testing::WithParamInterface<int64_t> {
-protected:
-    void SetUp() override {
-        KextTest::SetUp();
-        if (!IsSkipped()) Page().skewNs.store(GetParam());
-    }
-};
+class KextGlobal : public KextTest, public ::testing::WithParamInterface<int64_t> {};
 
 TEST_P(KextGlobal, ConversionSlotsFollowTheCallExactly) {
+    Page().skewNs.store(GetParam());
     LoadedLibrary lib;
     ASSERT_TRUE(lib.ok()) << lib.error();
     iKPusTimingEngine* e = lib.engine();
     // global = monotonic + the emulated REALTIME offset + the epoch offset
     const uint64_t shift = static_cast<uint64_t>(Page().realOffsetNs.load() + GetParam() + EpochOffsetNs(e));
-    const Delta delta{Page()};
+    const Counts before = Page().Snapshot();
     const uint64_t now = MonoNowNs();
     for (uint64_t m : {now, now + 20 * kMs + 1, uint64_t{999999999}, uint64_t{123456789012345}}) {
         SCOPED_TRACE(m);
@@ -269,8 +244,8 @@ TEST_P(KextGlobal, ConversionSlotsFollowTheCallExactly) {
         EXPECT_EQ(U64(g), m + shift);
         EXPECT_EQ(U64(e->GlobalToMonotonic(g)), m);  // slot 17
     }
-    EXPECT_GE(delta()[kConvertMonoToReal], 4);
-    EXPECT_GE(delta()[kConvertRealToMono], 4);
+    EXPECT_GE(Page().Since(before)[kConvertMonoToReal], 4);
+    EXPECT_GE(Page().Since(before)[kConvertRealToMono], 4);
 }
 
 // A global wait, a global node waited for on its own semaphore, and a global
@@ -278,12 +253,13 @@ TEST_P(KextGlobal, ConversionSlotsFollowTheCallExactly) {
 // it, end then without the caller spinning on the call (a handful of
 // conversions). A wait still running 2 s after its deadline is ended by the unload.
 TEST_P(KextGlobal, GlobalDeadlinesEndAtTheConvertedTimeWithoutSpinning) {
+    Page().skewNs.store(GetParam());
     const char* const kinds[] = {"global wait", "global node", "global callback"};
     for (int k = 0; k < 3; ++k) {
         SCOPED_TRACE(kinds[k]);
         auto lib = std::make_unique<LoadedLibrary>();
         ASSERT_TRUE(lib->ok()) << lib->error();
-        const testsupport::QueltaApi api = lib->api();
+        const QueltaApi api = lib->api();
         iKPusTimingEngine* e = lib->engine();
         const uint64_t due = MonoNowNs() + 20 * kMs;
         const ClockTime target = e->MonotonicToGlobal(CT(due));
@@ -291,7 +267,7 @@ TEST_P(KextGlobal, GlobalDeadlinesEndAtTheConvertedTimeWithoutSpinning) {
         uint32_t generation = 0, abortFlag = 7;
         e->ReadGlobalWithGeneration(unused, generation);
         std::atomic<uint64_t> endedAt{0};
-        const Delta delta{Page()};
+        const Counts before = Page().Snapshot();
         std::thread waiter;
         if (k == 0) {
             waiter = std::thread([&] {
@@ -307,13 +283,10 @@ TEST_P(KextGlobal, GlobalDeadlinesEndAtTheConvertedTimeWithoutSpinning) {
             api.SetCallback(StampMonotonic, &endedAt);
             api.SetCallbackTime(&target, -1);
         }
-        const uint64_t end = testsupport::AwaitNonZero(endedAt, 20 * kMs + 2 * kSec);
-        const Counts d = delta();
+        const uint64_t end = AwaitNonZero(endedAt, 20 * kMs + 2 * kSec);
+        const Counts d = Page().Since(before);
         lib.reset();
         if (waiter.joinable()) waiter.join();
-        std::printf("%s, skew %+lld s: ended %.0f us after its deadline, %lld conversions by the caller\n", kinds[k],
-                    static_cast<long long>(GetParam() / kNs), (double(end) - double(due)) / 1e3,
-                    static_cast<long long>(d[kConvertByCallers]));
         EXPECT_NE(end, 0u) << "still waiting 2 s after its deadline";
         EXPECT_GE(end, due) << "ended before its deadline";
         if (end >= due) {

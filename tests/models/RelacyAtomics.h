@@ -95,11 +95,6 @@ struct Case {
     unsigned preemptions;
 };
 
-template <class Test>
-bool Simulate(rl::test_params& params) {
-    return rl::simulate<Test>(params);
-}
-
 // Discards Relacy's reports without allocating (they are written inside a simulation).
 struct NullBuffer : std::streambuf {
     int overflow(int c) override { return c; }

@@ -16,7 +16,6 @@ namespace {
 
 using models::RlAtomics;
 
-// --- engine/HandOff.h ------------------------------------------------------------
 
 // The words hold functions in the library; Relacy's atomics take object pointers only.
 struct Function {};
@@ -104,9 +103,7 @@ struct CallersAndStop : rl::test_suite<CallersAndStop, 2> {
 // may destroy it.
 template <bool kWithdraw>
 struct ObjectPublished : rl::test_suite<ObjectPublished<kWithdraw>, 2> {
-    struct Object {
-        rl::var<int> field;  // the object's words and virtual table
-    } object;
+    struct Object { rl::var<int> field; } object;  // the field: the object's words and virtual table
     rl::atomic<Object*> word;
 
     void before() { word.store(nullptr, rl::mo_relaxed, $); }
@@ -121,7 +118,6 @@ struct ObjectPublished : rl::test_suite<ObjectPublished<kWithdraw>, 2> {
     }
 };
 
-// --- log/LogHandOff.h ------------------------------------------------------------
 
 using Entry = quelta::BasicLogEntry<RlAtomics>;
 using Record = quelta::BasicLogCpuRecord<RlAtomics>;
@@ -207,7 +203,6 @@ struct RingPublished : rl::test_suite<RingPublished, 2> {
     }
 };
 
-// --- tLinux/PalWake.h ------------------------------------------------------------
 
 using Word = quelta::BasicWakeWord<RlAtomics>;
 
@@ -277,16 +272,16 @@ struct WakeNotLost : rl::test_suite<WakeNotLost<kStop>, 2> {
 };
 
 const models::Case kCases[] = {
-    {"callback and argument", &models::Simulate<CallbackPair>, 4},
-    {"tick callback", &models::Simulate<TickCallbackRegistered>, 4},
-    {"lateness samples and their count", &models::Simulate<SamplesCounted>, 4},
-    {"callers and the stop", &models::Simulate<CallersAndStop>, 4},
-    {"object published", &models::Simulate<ObjectPublished<false>>, 4},
-    {"object withdrawn", &models::Simulate<ObjectPublished<true>>, 4},
-    {"log entries published by the write index", &models::Simulate<EntriesPublished>, 3},
-    {"log ring published to recorders", &models::Simulate<RingPublished>, 4},
-    {"wake word: a new expiry is never lost", &models::Simulate<WakeNotLost<false>>, 6},
-    {"wake word: the stop request is never lost", &models::Simulate<WakeNotLost<true>>, 6},
+    {"callback and argument", &rl::simulate<CallbackPair>, 4},
+    {"tick callback", &rl::simulate<TickCallbackRegistered>, 4},
+    {"lateness samples and their count", &rl::simulate<SamplesCounted>, 4},
+    {"callers and the stop", &rl::simulate<CallersAndStop>, 4},
+    {"object published", &rl::simulate<ObjectPublished<false>>, 4},
+    {"object withdrawn", &rl::simulate<ObjectPublished<true>>, 4},
+    {"log entries published by the write index", &rl::simulate<EntriesPublished>, 3},
+    {"log ring published to recorders", &rl::simulate<RingPublished>, 4},
+    {"wake word: a new expiry is never lost", &rl::simulate<WakeNotLost<false>>, 6},
+    {"wake word: the stop request is never lost", &rl::simulate<WakeNotLost<true>>, 6},
 };
 
 }  // namespace
