@@ -136,7 +136,7 @@ TEST_F(LibraryCalls, ASignalFloodShortensNoWait) {
     waiter.join();
     sigaction(SIGUSR1, &old, nullptr);
     EXPECT_EQ(early.load(), 0) << "signals sent: " << sent;
-    EXPECT_GT(sent, 100u);
+    EXPECT_GT(sent, 10u) << "too few signals to prove anything";
 }
 
 std::atomic<uint64_t> gCallbackAt{0};
