@@ -17,8 +17,7 @@
 
 namespace testsupport {
 
-class FakeTimer : public quelta::tKPusLinuxNanoSleepTimer {
-public:
+struct FakeTimer : quelta::tKPusLinuxNanoSleepTimer {
     FakeTimer() { state.status.store(static_cast<int32_t>(quelta::TimerThreadStatus::kServing)); }
     // A scheduler re-arming without end (a fault) ends the process, not the machine's memory.
     void SetExpiry(ClockTime when) override { armed.size() < 1000000 ? armed.push_back(when) : std::abort(); }
