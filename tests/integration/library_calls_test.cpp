@@ -1,6 +1,4 @@
-// Every call of the exported interface through the loaded library: never
-// early, results as documented (the README's table), bad input refused without
-// blocking or disturbing the wait nodes, no page fault once warmed up.
+// Every call through the loaded library: never early, results as the README's table says, bad input refused.
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/resource.h>
@@ -207,7 +205,7 @@ TEST_F(LibraryCalls, LogCapacitiesAndReadOutCounts) {
     for (const auto& read : reads) {
         uint32_t count = read.asked;
         log->ReadOut7(count, lo, hi, ev, 0);
-        if (read.asked) EXPECT_EQ(count, read.got);
+        EXPECT_TRUE(read.asked == 0 || count == read.got) << count;
     }
     delete log;
 }

@@ -1,9 +1,5 @@
-// Loading, running and unloading the built libquelta.so.6 as a runtime does,
-// and what the runtime sees of it besides its calls: only its entries are
-// exported, every virtual slot is an entry point of its own (the runtime calls
-// by slot position), the run-time types carry their plain names, no
-// build-machine path is carried, and the shared semaphore record does not
-// depend on the width of time_t.
+// Loading, ticking and unloading libquelta.so.6 as a runtime does, and what the runtime sees of it besides
+// its calls: exports, virtual slots by position, plain type names, no build paths, the shared record's layout.
 #include <dlfcn.h>
 #include <gtest/gtest.h>
 #include <stdlib.h>

@@ -1,7 +1,4 @@
-// Without real-time privilege the timer thread cannot run at SCHED_FIFO. The
-// library still loads, says so once on standard error, refuses every wait that
-// needs the timer thread at once with "no timer", keeps the plain waits
-// working, and unloads promptly.
+// Without real-time privilege the library loads, says so once, refuses the timer's waits at once, keeps plain waits.
 #include <gtest/gtest.h>
 #include <linux/capability.h>
 #include <sys/resource.h>

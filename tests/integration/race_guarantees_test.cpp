@@ -1,8 +1,4 @@
-// The promises only races can break, through the loaded library: a post that
-// meets an event wait's timeout is neither lost nor invented; a caller blocked
-// in I/O holds up no tick; a global deadline from before boot is simply past;
-// unloading leaves the application's signal handler alone and ends every wait
-// inside the library.
+// The promises only races can break, through the loaded library.
 #include <gtest/gtest.h>
 
 #include <fcntl.h>

@@ -1,6 +1,4 @@
-// A SCHED_RR holder of a semaphore's mutex runs at the priority of a higher
-// thread that blocks posting to it (priority inheritance), and the post goes
-// through after.
+// A semaphore's mutex lends a blocked higher-priority poster's priority to its holder.
 #include <gtest/gtest.h>
 
 #include <atomic>

@@ -1,8 +1,5 @@
-// Start-up and stop in this process (the internal library, without the load
-// hook): the first tick's time, and an allocation failure at every allocation
-// start-up makes (each reported, what it releases gone at once, the rest
-// released by the stop exactly once; the sanitizer build checks for leaks and
-// double frees).
+// Start-up and stop in this process: the first tick's time, and an allocation failure at every allocation
+// start-up makes (reported, released once; the sanitizer build checks for leaks and double frees).
 #include <gtest/gtest.h>
 
 #include <atomic>

@@ -1,7 +1,5 @@
-// The timer with its thread at top SCHED_FIFO priority: deadlines are never
-// served early, deadlines set from other threads take effect at once through
-// the wake stand-in, the plain SIGALRM fallback behaves as designed, and
-// destruction is prompt and leaves nothing behind.
+// The timer thread at top SCHED_FIFO priority: never early, settings from other threads take effect at once,
+// the SIGALRM fallback as designed, prompt destruction, and no wake lost wherever it lands.
 #include <dlfcn.h>
 #include <gtest/gtest.h>
 #include <pthread.h>
@@ -323,19 +321,11 @@ TEST_F(RtTimer, ConcurrentSettersNeverGetEarlyCallbacksNorLoseTheLastWake) {
     EXPECT_EQ(early, 0) << "callbacks served before any deadline they could belong to";
 }
 
-// The wake sweep. A deadline set from another thread must end the timer thread's sleep
-// wherever the setting lands, in particular between the thread's last look at
-// its wake state and its entry into the kernel. Each round the callback
-// re-arms for a deadline kOldDeadline ahead and returns; the waker, on the
-// other CPU, then sets one already due. A swept offset moves the two apart
-// (negative: the callback spins before it returns; positive: the waker spins
-// before it sets), so the wake lands in the callback, on the way into the
-// sleep and in it. A lost wake shows as a callback only at the old deadline.
-// On 32-bit glibc clock_nanosleep copies the request into its own frame
-// before the kernel call; a design that edits the caller's request from a
-// signal handler loses wakes in that window. The second sweep widens it: this
-// program's clock_nanosleep makes the same copy and waits kWrapperWindowNs.
-
+// The wake sweep: each round the callback re-arms far ahead and returns; the waker on the other CPU then
+// sets a due deadline. A swept offset (negative: the callback spins; positive: the waker spins) lands the
+// wake in the callback, on the way into the sleep and in it; a lost one ends only at the old deadline. The
+// second sweep widens the 32-bit C library's window (clock_nanosleep copying the request before the kernel
+// call) with this program's own clock_nanosleep, which makes the same copy and waits kWrapperWindowNs.
 constexpr uint64_t kOldDeadline = 150 * kMs;  // what a lost wake sleeps on to
 constexpr uint64_t kLost = 100 * kMs;         // a wake this late was lost
 
