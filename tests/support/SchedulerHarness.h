@@ -51,8 +51,7 @@ public:
         gCallbackFn.store(nullptr), gCallbackArg.store(nullptr), gTickCallback.store(nullptr);
         gConvertStandInEnabled.store(true), SetLoadTimeSchedulerState();
     }
-    void SetNow(uint64_t ns) { now_ = ns; }
-    uint64_t Now() const { return now_; }
+    void SetNow(uint64_t ns) { now_ = ns; }  uint64_t Now() const { return now_; }
     void Pass() { quelta::TickServiceRoutine(); }  // one tick service pass at Now()
     void RemoveTimer() { delete quelta::gTimer.exchange(nullptr), timer = nullptr; }
     void GiveNodesSemaphores() {  // as start-up does; the waits that block on a node need one

@@ -46,8 +46,7 @@ int RecordSleep(clockid_t clock, int flags, const timespec* request, timespec* r
     if (--gInterruptions, remaining != nullptr) *remaining = SplitNanoseconds(gRemaining);
     return EINTR;
 }
-Sleep Until(uint64_t t) { return {true, t}; }  // absolute
-Sleep For(uint64_t d) { return {false, d}; }    // relative
+Sleep Until(uint64_t t) { return {true, t}; }  Sleep For(uint64_t d) { return {false, d}; }  // absolute, relative
 
 class PlainWaitTest : public ::testing::Test {
 protected:
