@@ -135,12 +135,14 @@ void TickServiceRoutine() {
         // neither converted nor folded). The global clock is consulted only
         // while something waits on it, so a pass at rest (the tick alone)
         // makes no conversion.
+        // A global node queued from here on (by a caller, or by the callback)
+        // is seen under the lock, and the pass looks again with a conversion.
+        const uint64_t globalTime = gGlobalCallbackTime.Load();
+        const bool needGlobal = !IsNever(globalTime) || GlobalNodesQueued();
         const uint64_t now = ReadNow(engine);
         const ClockTime nowTime = FromU64(now);
         const uint64_t callbackTime = gMonotonicCallbackTime.Load();
         FireIfDue(gMonotonicCallbackTime, callbackTime, Due(callbackTime, now), &nowTime);
-        const uint64_t globalTime = gGlobalCallbackTime.Load();
-        const bool needGlobal = !IsNever(globalTime) || GlobalNodesQueued();
         const uint64_t nowGlobal = needGlobal ? ToU64(slots->MonotonicToGlobal(nowTime)) : now;
         const int64_t offset = GlobalOffsetOf(now, nowGlobal);
         // The global callback time is compared on the global clock, so that
