@@ -1,51 +1,39 @@
 #!/usr/bin/env bash
-# Mutation testing, on demand (not part of CI: a full run takes about an hour).
+# Mutation testing, on demand (not in CI). Each mutant below is one small
+# deliberate fault in the library: an exact piece of source text and what it
+# becomes. Each is applied alone to a copy of the tree (the working tree is
+# never edited), built, and the unit label run, then rt, integration and
+# kext. An `i686.` mutant is a fault only a 32-bit target has: it is built for
+# i686 and run against kext there. A mutant is killed when a test fails or
+# hangs; tests that fail without any mutant are left out. A mutant that does
+# not compile is reported and not counted.
 #
-# Each mutant below is one small deliberate fault in the library: an exact
-# piece of source text and what it becomes. The mutants are applied one at a
-# time to a copy of the tree in build/mutation/src (the working tree itself is
-# never edited), built in build/mutation/build, and the fast tests are run
-# against each: the unit label first, then rt, integration and kext (never
-# long, hostclock, tools, example, packaging or docs). A mutant whose id begins
-# with `i686.` is a fault only a 32-bit target has: it is built for i686 in
-# build/mutation/build-i686 and run against the kext label there. A mutant is
-# killed when a test fails or hangs. Tests that already fail without any
-# mutant are left out.
-# The score is killed / (killed + survived); a mutant that does not compile is
-# reported and not counted.
-#
-# Usage: scripts/mutate.sh [--check] [--list] [--unit-only] [--only ID[,ID...]] [--jobs N]
+# Usage: scripts/mutate.sh [--check] [--list] [--only ID,...] [--jobs N]
 #                          [--work DIR] [--tests REGEX] [--all-killers]
-#   --check      only verify that every mutant's text occurs exactly once
-#   --list       print the mutants
-#   --unit-only  run the unit label only (quick, a lower bound of the score;
-#                the i686 mutants are left out)
-#   --only       run the named mutants (and the baseline)
-#   --work       the scratch directory (default build/mutation), so that two
-#                runs can go side by side
-#   --tests      run only the tests whose names match REGEX
-#   --all-killers  run every test against every mutant and name all that
-#                fail (slower; shows which faults only one test catches)
+#   --check        verify that every mutant's text occurs exactly once
+#   --list         print the mutants
+#   --only         run the named mutants (and the baseline)
+#   --work         the scratch directory (default build/mutation)
+#   --tests        run only the tests whose names match REGEX
+#   --all-killers  run every test against every mutant and name all that fail
 #
-# Format of the list: `id @@ file @@ original text @@ mutated text`, one per
-# line; `<NL>` stands for a line break. The original text must occur exactly
-# once in its file: when the code changes, --check names the stale mutants.
+# List format: `id @@ file @@ original text @@ mutated text`; `<NL>` stands
+# for a line break.
 set -uo pipefail
 root=$(cd "$(dirname "$0")/.." && pwd)
 work=$root/build/mutation
 
-check_only=0 list_only=0 unit_only=0 only="" jobs=2 tests="" all_killers=0
+check_only=0 list_only=0 only="" jobs=2 tests="" all_killers=0
 while [ $# -gt 0 ]; do
   case $1 in
     --check) check_only=1 ;;
     --list) list_only=1 ;;
-    --unit-only) unit_only=1 ;;
     --only) only=$2; shift ;;
     --jobs) jobs=$2; shift ;;
     --work) work=$(realpath -m "$2"); shift ;;
     --tests) tests=$2; shift ;;
     --all-killers) all_killers=1 ;;
-    *) echo "usage: $0 [--check] [--list] [--unit-only] [--only ID[,ID...]] [--jobs N] [--work DIR] [--tests REGEX] [--all-killers]" >&2; exit 2 ;;
+    *) echo "usage: $0 [--check] [--list] [--only ID[,ID...]] [--jobs N] [--work DIR] [--tests REGEX] [--all-killers]" >&2; exit 2 ;;
   esac
   shift
 done
@@ -197,12 +185,10 @@ selected() {
   mutants | grep -v '^\s*#' | grep -v '^\s*$' | awk -F ' @@ ' -v only="$only" '
     BEGIN { n = split(only, want, ","); for (i = 1; i <= n; i++) pick[want[i]] = 1 }
     { if (NF != 4) { print "malformed: " $0 > "/dev/stderr"; exit 2 }
-      if (only == "" || ($1 in pick)) printf "%s\t%s\t%s\t%s\n", $1, $2, $3, $4 }' |
-    { if [ "$unit_only" = 1 ] && [ "$check_only$list_only" = 00 ]; then grep -v '^i686\.'; else cat; fi; }
+      if (only == "" || ($1 in pick)) printf "%s\t%s\t%s\t%s\n", $1, $2, $3, $4 }'
 }
 
-# Replaces the one occurrence of FROM by TO in file $1; exit 3 when FROM does
-# not occur exactly once (the file is then left as it was).
+# Replaces the one occurrence of FROM by TO in file $1 (else exit 3, file kept).
 replace_once() {
   perl -e '
     my ($file) = @ARGV;
@@ -220,8 +206,7 @@ if [ $list_only = 1 ]; then
   exit 0
 fi
 
-# --check: every original text occurs exactly once in the working tree (the
-# file is rewritten in a scratch copy only).
+# --check: every original text occurs exactly once (checked in a scratch copy).
 stale=0 total=0
 scratch=$(mktemp)
 trap 'rm -f "$scratch"' EXIT
@@ -238,9 +223,7 @@ if [ $check_only = 1 ]; then echo "$total mutants, all apply"; exit 0; fi
 mkdir -p "$work"
 rm -rf "$work/src" "$work/logs"
 mkdir -p "$work/src" "$work/logs"
-# Extracted with the time of extraction (-m), so that a build left behind by an
-# interrupted run, made from a mutated file, is older than every file of the
-# copy and is rebuilt, never taken as current.
+# -m: a build left by an interrupted run (of a mutated file) is older than the copy.
 tar -C "$root" --exclude=./build --exclude=./.git -cf - . | tar -C "$work/src" -xmf -
 current=""  # the file of the copy that carries a mutant right now
 restore() {
@@ -257,8 +240,7 @@ dir_of() { case $1 in i686.*) echo "$work/build-i686" ;; *) echo "$work/build" ;
 configure() {  # build directory, log name, extra cmake arguments...
   local dir=$1 name=$2; shift 2
   echo "configuring and building the copy in $dir"
-  # Optimised as the suite's own stages, without debug information (it would
-  # only slow down the many rebuilds).
+  # Optimised as the suite's stages; no debug information (it slows the rebuilds).
   cmake -S "$work/src" -B "$dir" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
     -DCMAKE_CXX_FLAGS_RELWITHDEBINFO="-O2 -DNDEBUG" -DCMAKE_C_FLAGS_RELWITHDEBINFO="-O2 -DNDEBUG" \
     -DQUELTA_BUILD_BENCH=OFF -DQUELTA_BUILD_TOOLS=OFF "$@" >"$work/logs/configure-$name.log" 2>&1 \
@@ -273,12 +255,11 @@ selected | cut -f1 | grep -q '^i686\.' && needs_i686=1
 # The 32-thread stress test runs 5 s per mutant instead of 20.
 export QUELTA_STRESS_SECONDS=${QUELTA_STRESS_SECONDS:-5}
 stages=(unit 'rt|integration|kext')
-[ $unit_only = 1 ] && stages=(unit)
 stages_of() { case $1 in "$work/build-i686") echo kext ;; *) echo "${stages[@]}" ;; esac; }
 stage_timeout() { [ "$1" = unit ] && echo 240 || echo 480; }
 
-# Runs one stage; prints the failing tests (or "timeout") and returns 1
-# when a test failed. $1 label regex, $2 log, $3 exclusion regex, $4 build.
+# Runs stage $1 (label regex) of build $4, logging to $2, leaving out $3;
+# prints the failing tests (or "timeout") and returns 1 when a test failed.
 run_stage() {
   local label=$1 log=$2 exclude=$3 dir=$4 args=()
   [ -n "$exclude" ] && args=(-E "$exclude")
@@ -286,8 +267,7 @@ run_stage() {
   [ $all_killers = 1 ] || args+=(--stop-on-failure)
   local start
   start=$(wc -l <"$log")
-  # A mutant can turn a loop into a runaway that allocates without end: each
-  # test gets 4 GB of address space, far more than any needs.
+  # 4 GB of address space per test stops a mutant's runaway allocation.
   (ulimit -v 4194304
    timeout -k 10 "$(stage_timeout "$label")" ctest --test-dir "$dir" -L "$label" -LE 'long|hostclock' \
      --output-on-failure "${args[@]}") >>"$log" 2>&1
@@ -301,8 +281,7 @@ run_stage() {
   return 0
 }
 
-# Baseline: tests that fail without any mutant are left out of every run
-# in that build. Prints the exclusion regex of build $1.
+# Prints the exclusion regex of build $1: the tests that fail without a mutant.
 baseline() {
   local dir=$1 name=native label failing=()
   [ "$dir" = "$work/build" ] || name=i686

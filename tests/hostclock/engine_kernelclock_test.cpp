@@ -1,7 +1,5 @@
-// The one test that touches the machine's clock discipline (label hostclock,
-// opt-in; needs CAP_SYS_TIME, skipped without): the engine sets the kernel
-// clock's current rate back to itself and steps the wall clock by zero. tick
-// and freq are put back to the values found, whatever happens.
+// Opt-in (label hostclock, CAP_SYS_TIME): the engine sets the kernel clock's rate back to itself and steps
+// the wall clock by zero; tick and freq are put back to the values found, whatever happens.
 #include <gtest/gtest.h>
 #include <sys/timex.h>
 

@@ -1,20 +1,16 @@
-// The emulated kernel extension the kext tests run the library on. Before any
-// test (and any thread) the process takes a private mount namespace with a
-// tmpfs over /sys/kernel for the two sysfs files, forks a supervisor and
-// installs a seccomp filter whose listener the supervisor holds; every thread
-// made afterwards (the timer thread among them) is served by it. Where the
-// machine refuses any of that, every test skips with one line. The supervisor
-// (single-threaded, after fork only system calls and snprintf) serves the
-// calls with the harshest semantics a kernel could plausibly have:
-// - sched_wake_up(tid) ends that timer thread's emulated sleep with -EAGAIN;
-//   a wake for a timer thread not asleep at that moment is lost.
-// - clock_converttime(from, to, ts) converts in place in the caller's own
-//   timespec layout, CLOCK_REALTIME moved by the skew knob; an unknown clock
-//   or a result the layout cannot hold fails, ts untouched.
-// - A timer thread's clock_nanosleep on CLOCK_MONOTONIC is answered 0 at its
-//   deadline or -EAGAIN on a wake; other sleeps go to the real kernel. A
-//   sleep whose thread took a signal is dropped (the thread sees EINTR).
-// - Read-only opens of the two sysfs files are counted and let through.
+// The emulated kernel extension the kext tests run on. Before any thread, the
+// process takes a private mount namespace (a tmpfs over /sys/kernel for the two
+// sysfs files), forks a supervisor and installs a seccomp filter whose listener
+// it holds; where the machine refuses, every test skips with one line. The
+// supervisor (single-threaded: only system calls and snprintf after fork) is as
+// harsh as a kernel could plausibly be:
+// - sched_wake_up(tid) ends that timer thread's sleep with -EAGAIN; a wake that
+//   finds it not asleep is lost.
+// - clock_converttime converts in the caller's own timespec layout, the wall
+//   clock moved by the skew knob; an unknown clock or overflow fails.
+// - A timer thread's monotonic clock_nanosleep ends at its deadline or on a
+//   wake; other sleeps go to the kernel; a signalled thread sees EINTR.
+// - Read-only opens of the sysfs files are counted and let through.
 #ifndef QUELTA_TESTS_KEXT_KEXT_H
 #define QUELTA_TESTS_KEXT_KEXT_H
 

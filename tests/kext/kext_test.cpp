@@ -1,8 +1,6 @@
-// The library on the emulated kernel extension: the sysfs files read once per
-// start-up, the timer thread woken through sched_wake_up (its failure, 38,
-// falls back to SIGALRM with one warning; a lost wake costs at most a tick),
-// and the global clock through clock_converttime under a wall clock skewed
-// 7 s either way.
+// The library on the emulated kernel extension: sysfs read once per start-up,
+// wakes through sched_wake_up (38: SIGALRM and one warning; a lost wake costs
+// at most a tick), conversions under a wall clock skewed 7 s either way.
 #include <dlfcn.h>
 
 #include <algorithm>

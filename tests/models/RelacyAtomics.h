@@ -1,11 +1,8 @@
-// The atomics policy of tLinux/PalAtomic.h over Relacy's model of the C++
-// memory model, and the driver of the models. A model runs the library's own
-// hand-off templates over RlAtomics: every load may return any value the
-// memory model allows, and a plain rl::var read without a happens-before edge
-// from its write is a data race. Include the library's headers BEFORE this one
-// (Relacy's macros would rewrite them). Each ordered operation knows its call
-// site in the library (__builtin_FILE/LINE where the template calls the
-// policy), so `--weaken-each` can rerun the models with that one order weakened.
+// The atomics policy of tLinux/PalAtomic.h over Relacy's memory model, and the
+// models' driver: every load may return any value the model allows, and an
+// rl::var read without happens-before from its write is a race. Include the
+// library's headers BEFORE this one (Relacy's macros would rewrite them). Each
+// ordered operation knows its call site, so `--weaken-each` can weaken one.
 #ifndef QUELTA_MODELS_RELACYATOMICS_H
 #define QUELTA_MODELS_RELACYATOMICS_H
 

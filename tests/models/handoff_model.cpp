@@ -1,8 +1,6 @@
-// The library's lock-free hand-offs under the C++ memory model: the engine's
-// small ones (engine/HandOff.h), the log ring's (log/LogHandOff.h) and the
-// timer thread's wake word (tLinux/PalWake.h). Each runs the library's own
-// steps over RlAtomics; what a hand-off carries is a plain rl::var, so a
-// missing edge shows as a data race or a stale value.
+// The library's lock-free hand-offs (engine/HandOff.h, log/LogHandOff.h, the
+// wake word of tLinux/PalWake.h) run over RlAtomics; what a hand-off carries
+// is a plain rl::var, so a missing edge shows as a data race or a stale value.
 #include <errno.h>
 #include <time.h>
 

@@ -212,10 +212,8 @@ void CountingAlarm(int sig) {
     Timer::AlarmHandler(sig);
 }
 
-// While the stand-in serves, nothing is printed. Under the fallback a SIGALRM
-// cannot end the sleep (EINTR resumes it): a new deadline is taken once the
-// one slept on is served. (A thread parked on the far deadline would never
-// take one, so the stand-in is switched off only for the settings under test.)
+// While the stand-in serves, nothing is printed. Under the fallback a SIGALRM cannot end the sleep (EINTR
+// resumes it): a new deadline is taken once the one slept on is served.
 TEST_F(RtTimer, FallbackWarnsOncePerProcessSignalsEveryTimeAndServesAfterTheOldDeadline) {
     gWakeSyscallNr = -1, gWakeWarningShown = 0;
     testing::internal::CaptureStdout();
@@ -249,11 +247,8 @@ TEST_F(RtTimer, FallbackWarnsOncePerProcessSignalsEveryTimeAndServesAfterTheOldD
     }
 }
 
-// Two threads set deadlines (some past) at random moments. A mutex serialises
-// the settings: setting k arms armed[k]. A callback serves the value the
-// thread took last, set after the settings done before the previous callback
-// ended (k >= floor) and before this one began (k <= seen): no callback may
-// come before the smallest deadline in armed[floor..seen].
+// Two threads set deadlines (some past) at random; setting k arms armed[k]. A callback serves a value set
+// after the previous callback ended (k >= floor) and before it began (k <= seen): never before all of them.
 constexpr int kMaxSets = 1 << 16;
 std::atomic<uint64_t> gArmed[kMaxSets], gStressAt[kMaxCalls];
 std::atomic<int> gSetStarted{0}, gSetDone{0}, gStressSeen[kMaxCalls], gStressFloor[kMaxCalls];
@@ -321,11 +316,10 @@ TEST_F(RtTimer, ConcurrentSettersNeverGetEarlyCallbacksNorLoseTheLastWake) {
     EXPECT_EQ(early, 0) << "callbacks served before any deadline they could belong to";
 }
 
-// The wake sweep: each round the callback re-arms far ahead and returns; the waker on the other CPU then
-// sets a due deadline. A swept offset (negative: the callback spins; positive: the waker spins) lands the
-// wake in the callback, on the way into the sleep and in it; a lost one ends only at the old deadline. The
-// second sweep widens the 32-bit C library's window (clock_nanosleep copying the request before the kernel
-// call) with this program's own clock_nanosleep, which makes the same copy and waits kWrapperWindowNs.
+// The wake sweep: the callback re-arms far ahead; the waker on the other CPU then sets a due deadline, at a
+// swept offset (<0: the callback spins; >0: the waker spins) that lands it in the callback, on the way into
+// the sleep and in it; a lost one ends only at the old deadline. The second sweep widens the 32-bit C
+// library's window (its clock_nanosleep copies the request) with this program's own clock_nanosleep.
 constexpr uint64_t kOldDeadline = 150 * kMs;  // what a lost wake sleeps on to
 constexpr uint64_t kLost = 100 * kMs;         // a wake this late was lost
 

@@ -241,11 +241,9 @@ ReadOutResult ReferenceReadOut(const std::vector<std::vector<ModelEntry>>& model
     return r;
 }
 
-// Random logs on 1 to 256 CPUs, read out by the engine and by the reference:
-// the same count, every word of every array, the same bank afterwards. The
-// logs have equal stamps across CPUs, CPU indices to fold, wrapped, empty and
-// inline rings, times never selected (0, high word 0xFFFFFFFF), rings out of
-// time order, and read-outs of 0, some, all and more than held, made twice.
+// Random logs on 1 to 256 CPUs read out by the engine and by the reference agree word for word: equal
+// stamps across CPUs, CPU indices to fold, wrapped, empty and inline rings, times never selected (0, high
+// word 0xFFFFFFFF), rings out of time order; read-outs of 0, some, all and more than held, made twice.
 TEST(LogReadOut, MatchesTheStraightforwardSelection) {
     FakeCpuSeam seam;
     std::mt19937 rng(20261123);
