@@ -21,8 +21,14 @@ namespace quelta {
 extern AtomicClockTime gNextTick;               // next 1 ms tick (monotonic)
 extern AtomicClockTime gTickPeriod;             // 0 at load, 1,000,000 at start
 extern AtomicClockTime gNextDeadline;           // armed / earliest found so far
-extern AtomicClockTime gMonotonicCallbackTime;  // NeverTime = none
-extern AtomicClockTime gGlobalCallbackTime;     // on the global clock
+// The callback times (NeverTime = none; the global one on the global clock):
+// callers store them under gSchedLock, together with the arming. The timer
+// thread claims a due one without the lock, by a compare-exchange to NeverTime
+// against the value it read, so that a callback never waits for a caller in
+// the lock; a store made meanwhile makes the claim fail, and the pass's
+// locked part looks again.
+extern AtomicClockTime gMonotonicCallbackTime;
+extern AtomicClockTime gGlobalCallbackTime;
 extern std::atomic<QueltaCallbackFn> gCallbackFn;       // PublishCallback / TakeCallback
 extern std::atomic<void*> gCallbackArg;
 extern std::atomic<QueltaTickCallbackFn> gTickCallback;  // PublishTickCallback / TakeTickCallback

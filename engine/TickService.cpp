@@ -134,9 +134,9 @@ void TickServiceRoutine() {
         // callback time on the monotonic clock (NeverTime cancels: it is
         // neither converted nor folded). The global clock is consulted only
         // while something waits on it, so a pass at rest (the tick alone)
-        // makes no conversion.
-        // A global node queued from here on (by a caller, or by the callback)
-        // is seen under the lock, and the pass looks again with a conversion.
+        // makes no conversion; a global node queued after this check (by a
+        // caller, or by the callback) is seen under the lock, and the pass
+        // looks again with a conversion.
         const uint64_t globalTime = gGlobalCallbackTime.Load();
         const bool needGlobal = !IsNever(globalTime) || GlobalNodesQueued();
         const uint64_t now = ReadNow(engine);
