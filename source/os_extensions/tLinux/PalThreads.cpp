@@ -83,6 +83,14 @@ void PalSetThreadName(const char* name) {
     prctl(PR_SET_NAME, reinterpret_cast<unsigned long>(name), 0ul, 0ul, 0ul);
 }
 
+// The kernel may end a timed sleep up to the thread's timer slack late (50 us
+// by default) to batch wake-ups. clock_nanosleep ignores it for real-time
+// threads, and newer kernels clear it on the change to a real-time policy;
+// older ones apply it to a timed futex wait (the wake stand-in's sleep) of a
+// real-time thread all the same. 1 ns is the least that can be set: 0 means
+// "the default".
+void PalSetExactTimers() { prctl(PR_SET_TIMERSLACK, 1ul, 0ul, 0ul, 0ul); }
+
 int32_t PalSetAffinityAll() {
     if (gPalReady.load(std::memory_order_acquire) == 0) {
         PalPreconditionBreak();

@@ -29,6 +29,9 @@ extern std::atomic<int32_t> gCpuCount;      // cached online CPUs, -1 unread
 uint32_t PalInitialize();
 int32_t PalGetCpuCount();
 void PalSetThreadName(const char* name);
+// Asks the kernel to end this thread's timed sleeps on time rather than
+// within its default grouping allowance (see the definition).
+void PalSetExactTimers();
 int32_t PalSetAffinityAll();
 int32_t PalSetAffinityOne(int32_t cpu);
 int32_t PalSetThreadPriority(pthread_t thread, int32_t priority);

@@ -375,6 +375,7 @@ void* tKPusLinuxNanoSleepTimer::isrthread(TimerThreadState* state) {
         return nullptr;
     }
 
+    PalSetExactTimers();
     PrefaultStack();
     state->threadId.store(PalGetThreadId());
     SetStatus(*state, TimerThreadStatus::kServing);
