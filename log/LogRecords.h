@@ -28,7 +28,8 @@ constexpr uint32_t kLogInlineSlots = 20;
 constexpr uint32_t kLogInlineCapacity = 10;
 // A ring of this many entries or more is refused without asking the
 // allocator (Configure falls back to the inline ring): the log's documented
-// limit, where a 32-bit byte count of 16-byte entries overflows.
+// limit. On 32-bit targets a smaller ring can still need more bytes than
+// size_t holds (entries are 20 bytes); the allocation refuses that itself.
 constexpr uint32_t kLogMaxRingEntries = 1u << 28;
 // The data word of the entries made by the plain recording operations.
 constexpr uint32_t kLogNoData = 0xFFFFFFFFu;
