@@ -10,7 +10,8 @@
 //   clock moved by the skew knob; an unknown clock or overflow fails.
 // - A timer thread's monotonic clock_nanosleep ends at its deadline or on a
 //   wake; other sleeps go to the kernel; a signalled thread sees EINTR.
-// - Read-only opens of the sysfs files are counted and let through.
+// - Read-only opens of the sysfs files, and SIGALRMs to a timer thread, are
+//   counted and let through.
 #ifndef QUELTA_TESTS_KEXT_KEXT_H
 #define QUELTA_TESTS_KEXT_KEXT_H
 
@@ -61,7 +62,8 @@ enum Counter : int {
     kConvertMonoToReal, kConvertRealToMono, kConvertOther, kConvertRefused,
     kConvertByCallers,                        // served for threads other than a timer thread
     kOpensWakeFile, kOpensConvertFile,        // read-only opens of the sysfs files
-    kTimerSleeps, kSleepsInterrupted, kCounterCount  // a timer thread's emulated sleeps; those a signal ended
+    kTimerSleeps, kSleepsInterrupted,         // a timer thread's emulated sleeps; those a signal ended
+    kAlarmsToTimer, kCounterCount             // SIGALRMs sent to a timer thread
 };
 using Counts = std::array<int64_t, kCounterCount>;
 
@@ -94,10 +96,10 @@ static_assert(std::atomic<int64_t>::is_always_lock_free, "the page is shared bet
 // The calls the filter hands over, per architecture.
 struct ArchCalls {
     uint32_t arch;
-    int nanosleep32, nanosleep64, openat;  // nanosleep32: with a 32-bit timespec (-1: none)
+    int nanosleep32, nanosleep64, openat, tgkill;  // nanosleep32: with a 32-bit timespec (-1: none)
     bool narrowLong;                       // the conversion's timespec has 32-bit fields
 };
-constexpr ArchCalls kArchs[] = {{AUDIT_ARCH_X86_64, -1, 230, 257, false}, {AUDIT_ARCH_I386, 267, 407, 295, true}};
+constexpr ArchCalls kArchs[] = {{AUDIT_ARCH_X86_64, -1, 230, 257, 234, false}, {AUDIT_ARCH_I386, 267, 407, 295, 270, true}};
 
 inline int64_t NowNs(clockid_t clock) {
     timespec ts{};
@@ -303,6 +305,9 @@ private:
         }
         if (nr == a->nanosleep32 || nr == a->nanosleep64) return HandleSleep(n, *a);
         if (nr == a->openat) CountOpen(n);
+        if (nr == a->tgkill && n.data.args[2] == SIGALRM && IsTimer(static_cast<int>(n.data.args[1]))) {
+            page_->Add(kAlarmsToTimer);
+        }
         Continue(n.id);
     }
 
@@ -316,7 +321,7 @@ private:
     int echoTid_ = 0;  // the thread whose next sleep a wake's echo ends
 };
 
-// Traps, per architecture, the two extra calls, clock_nanosleep and openat.
+// Traps, per architecture, the two extra calls, clock_nanosleep, openat and tgkill.
 inline std::vector<sock_filter> FilterProgram() {
     std::vector<sock_filter> p = {BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, arch)),
                                   BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, kArchs[0].arch, 2, 0),
@@ -324,7 +329,8 @@ inline std::vector<sock_filter> FilterProgram() {
                                   BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW)};
     for (const ArchCalls& a : kArchs) {
         if (&a == &kArchs[1]) p[2].jt = static_cast<uint8_t>(p.size() - 3);
-        std::vector<uint32_t> nrs = {uint32_t(kWakeNr), uint32_t(kConvertNr), uint32_t(a.nanosleep64), uint32_t(a.openat)};
+        std::vector<uint32_t> nrs = {uint32_t(kWakeNr), uint32_t(kConvertNr), uint32_t(a.nanosleep64), uint32_t(a.openat),
+                                      uint32_t(a.tgkill)};
         if (a.nanosleep32 >= 0) nrs.push_back(uint32_t(a.nanosleep32));
         const uint8_t n = static_cast<uint8_t>(nrs.size());
         p.push_back(BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)));
