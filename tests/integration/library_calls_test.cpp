@@ -25,7 +25,6 @@ TEST_F(LibraryCalls, PlainWaitsNeverReturnEarly) {
     const std::function<void(uint64_t start, uint64_t delay)> waits[] = {  // each due at start + delay
         [&](uint64_t s, uint64_t d) { const ClockTime t = CT(s + d); api().WaitUntilClocks64(&t); },
         [&](uint64_t, uint64_t d) { api().WaitClocks(static_cast<uint32_t>(d)); },
-        [&](uint64_t s, uint64_t d) { api().WaitUntilClocks(static_cast<uint32_t>(s + d)); },
         [&](uint64_t, uint64_t d) { api().WaitMicroSeconds(static_cast<uint32_t>(d / kUs + 1)); },
     };
     for (uint64_t delay : {kMs / 3, 2 * kMs + 123456, 5 * kMs}) {

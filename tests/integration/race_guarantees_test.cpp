@@ -4,6 +4,7 @@
 #include <fcntl.h>
 #include <pthread.h>
 #include <signal.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -149,10 +150,24 @@ struct Waiter {
     uint32_t generation;
     PalSemaphore* semaphore = testsupport::NewRuntimeSemaphore();
     uint32_t result = 99;
+    pid_t tid = 0;  // written before `started` counts it
 };
+// Every waiter asleep in the kernel (state S), as one blocked inside the library is.
+bool AllAsleep(const std::vector<std::unique_ptr<Waiter>>& waiters) {
+    for (const auto& w : waiters) {
+        char path[64], state = '?';
+        std::snprintf(path, sizeof path, "/proc/self/task/%d/stat", static_cast<int>(w->tid));
+        FILE* f = std::fopen(path, "r");
+        const bool read = f != nullptr && std::fscanf(f, "%*d (%*[^)]) %c", &state) == 1;
+        if (f != nullptr) std::fclose(f);
+        if (!read || state != 'S') return false;
+    }
+    return true;
+}
 void* RunWaiter(void* arg) {
     auto* w = static_cast<Waiter*>(arg);
     ClockTime after{};
+    w->tid = static_cast<pid_t>(syscall(SYS_gettid));
     w->started->fetch_add(1);
     switch (w->kind) {
         case 0: w->result = w->api->EventWait(w->semaphore, 0xFFFFFFFFu); break;
@@ -188,7 +203,9 @@ TEST(RaceGuaranteesUnload, UnloadEndsEveryWaitInsideTheLibrary) {
     for (int i = 0; i < kWaiters; ++i) ASSERT_EQ(pthread_create(&threads[i], &small, RunWaiter, waiters[i].get()), 0);
     pthread_attr_destroy(&small);
     ASSERT_TRUE(Eventually([&] { return started.load() == kWaiters; }, 10000 * kMs));  // slow under an emulator
-    usleep(300000);  // then a moment for the last to block inside
+    int asleep = 0;  // in three looks 50 ms apart: inside, not on the way in
+    for (int polls = 0; asleep < 3 && polls < 400; ++polls, usleep(50000)) asleep = AllAsleep(waiters) ? asleep + 1 : 0;
+    ASSERT_EQ(asleep, 3) << "the waiters never all blocked";
     ASSERT_EQ(returned.load(), 0);
     lib.reset();  // the stop
     ASSERT_TRUE(Eventually([&] { return returned.load() == kWaiters; }, 2000 * kMs)) << "waits not ended by the unload";

@@ -516,7 +516,7 @@ TEST_F(ProbeCli, SurveyWritesEveryOutput) {
         if (e["ph"] != "X") continue;
         const std::string name = e["name"];
         const double lateness = e["args"].value("lateness_us", NAN), end = e["ts"].get<double>() + e["dur"].get<double>();
-        EXPECT_TRUE(std::abs(e["args"].value("deadline_us", NAN) + lateness - end) < 10000.0 &&
+        EXPECT_TRUE(std::abs(e["args"].value("deadline_us", NAN) + lateness - end) < 100000.0 &&
                     Has(name, " LATE") == (lateness > baseP99) && (name.rfind("callback-time", 0) == 0 || e["tid"] == cpu))
             << e.dump();
         ++spans, late += Has(name, " LATE");
@@ -554,9 +554,9 @@ TEST_F(ProbeCli, SignalEndsASurveyWithTheFilesWritten) {
 TEST_F(ProbeCli, AStoppedMachineShowsAsStalls) {
     const long cpus = sysconf(_SC_NPROCESSORS_ONLN);
     if (cpus < 2 || !testsupport::CanUseRealtime()) GTEST_SKIP() << "needs two CPUs and SCHED_FIFO";
-    const ProbeRun r = Run({"--duration", "4", "--cpu", std::to_string(cpus - 1), "--noise", "0", "--json", "-"}, {}, [&](pid_t pid) {
-        for (int i = 0; i < 300 && ReadFile(dir_ + "/stderr").empty(); ++i) SleepMs(100);
-        SleepMs(1000);  // surveying
+    const std::vector<std::string> args = {"--duration", "5", "--cpu", std::to_string(cpus - 1), "--noise", "0", "--interval", "1", "--json", "-"};
+    const ProbeRun r = Run(args, {}, [&](pid_t pid) {
+        for (int i = 0; i < 300 && !Has(ReadFile(dir_ + "/stderr"), "wakes,"); ++i) SleepMs(100);  // surveying
         for (int i = 0; i < 6; ++i) kill(pid, SIGSTOP), SleepMs(60), kill(pid, SIGCONT), SleepMs(50);
     });
     ASSERT_EQ(r.status, 0) << r.err;

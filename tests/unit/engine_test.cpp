@@ -576,14 +576,15 @@ TEST_F(EngineSlots, Slots33To35EventWaitsAndRelease) {
     quelta::PalSemaphoreDestroy(sem);
 }
 
-// 36-38 (us), 39-42 and 49 (ns) never wake before their target and return the time after.
+// 36-38 (us), 39-42 and 49 (ns) never wake before their target and return the time after. The
+// 32-bit targets lie 20 ms ahead: a test thread held past one (plus the 1 ms tolerance) would wait
+// for the low word to come round. Targets just passed are plainwait_test's, on a scripted clock.
 TEST_F(EngineSlots, Slots36To42And49WaitForTheirTarget) {
     enum Kind { kFor, kNextMultiple, kUntil };
     const struct { int slot; uint64_t unitNs; Kind kind; int64_t amount; } cases[] = {
-        {36, 1000, kFor, 2000},   {37, 1000, kNextMultiple, 3000}, {38, 1000, kUntil, 1500},
-        {38, 1000, kUntil, -500}, {39, 1, kFor, 2000000},          {40, 1, kNextMultiple, 3000000},
-        {41, 1, kUntil, 1500000}, {42, 1, kUntil, 1500000},        {42, 1, kUntil, -500000},
-        {49, 1, kNextMultiple, 2000000}, {49, 1, kUntil, 0},  // period 0: the time at once
+        {36, 1000, kFor, 2000},   {37, 1000, kNextMultiple, 3000}, {38, 1000, kUntil, 20000},
+        {39, 1, kFor, 2000000},   {40, 1, kNextMultiple, 3000000}, {41, 1, kUntil, 1500000},
+        {42, 1, kUntil, 20000000}, {49, 1, kNextMultiple, 2000000}, {49, 1, kUntil, 0},  // period 0: at once
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.slot);
@@ -596,7 +597,6 @@ TEST_F(EngineSlots, Slots36To42And49WaitForTheirTarget) {
                                           : Slot<uint32_t, uint32_t>(e, c.slot, uint32_t(c.kind == kUntil ? target : c.amount));
         const uint64_t after = testsupport::MonoNowNs() / c.unitNs, from = c.amount > 0 ? target : before;
         if (c.amount > 0) { EXPECT_GE(after + slack, target); }
-        if (c.amount < 0) { EXPECT_LT(after - before, 500 * kMs / c.unitNs); }
         const uint64_t mask = c.slot == 49 ? ~uint64_t(0) : 0xFFFFFFFFu;
         EXPECT_LE((r - from) & mask, after + slack - from);
         EXPECT_TRUE((c.slot != 39 && c.amount != 0) || (Read(e, 46) & mask) == r) << "the wait records the time";
