@@ -8,12 +8,10 @@
 #include <vector>
 
 #include "LoadedLibrary.h"
+#include "TestSupport.h"
 #include "tLinux/PalSemaphoreOps.h"
 
 namespace testsupport {
-
-inline uint64_t U64(const ClockTime& t) { return (static_cast<uint64_t>(t.high) << 32) | t.low; }
-inline ClockTime CT(uint64_t v) { return ClockTime{static_cast<uint32_t>(v), static_cast<uint32_t>(v >> 32)}; }
 
 // Posts not yet taken, taking them all.
 inline int Drain(PalSemaphore* s) {

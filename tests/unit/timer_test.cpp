@@ -26,20 +26,19 @@ void CountAlarm(int) { gAlarms.fetch_add(1); }
 // of SIGALRM) do not end the sleep; a wake does; a wake made after the
 // snapshot but before the sleep starts is not lost: that sleep returns at once.
 TEST(WakeStandIn, DeadlinesSignalsAndWakes) {
-    struct sigaction counting {}, saved {};
-    counting.sa_handler = &CountAlarm;
-    sigaction(SIGALRM, &counting, &saved);
     PalWakeWord word;
     std::atomic<PalSleepResult> result{PalSleepResult::kFailed};
     std::atomic<uint64_t> returned{0};
     const uint64_t deadline = MonoNowNs() + 80 * kMs;
-    std::thread sleeper([&] {
-        result = PalWakeableSleepUntil(word, PalWakeSnapshot(word), At(deadline));
-        returned = MonoNowNs();
-    });
-    while (returned == 0) pthread_kill(sleeper.native_handle(), SIGALRM), usleep(5000);
-    sleeper.join();
-    sigaction(SIGALRM, &saved, nullptr);
+    {
+        testsupport::ScopedAlarmHandler counting(&CountAlarm);
+        std::thread sleeper([&] {
+            result = PalWakeableSleepUntil(word, PalWakeSnapshot(word), At(deadline));
+            returned = MonoNowNs();
+        });
+        while (returned == 0) pthread_kill(sleeper.native_handle(), SIGALRM), usleep(5000);
+        sleeper.join();
+    }
     EXPECT_TRUE(result.load() == PalSleepResult::kDeadline && returned.exchange(0) >= deadline);
     std::thread woken([&] {
         result = PalWakeableSleepUntil(word, PalWakeSnapshot(word), At(MonoNowNs() + 10000 * kMs));
@@ -60,9 +59,7 @@ TEST(WakeStandIn, DeadlinesSignalsAndWakes) {
 // the expiry (32-bit seconds and nanoseconds) and wake nobody; destroying it
 // starts or joins no thread, sends no signal, leaves SIGALRM's action alone.
 TEST(TimerSlots, WithoutAThreadSetExpiryOnlyStoresAndDestructionIsQuiet) {
-    struct sigaction counting {}, saved {}, after {};
-    counting.sa_handler = &CountAlarm;
-    sigaction(SIGALRM, &counting, &saved);
+    testsupport::ScopedAlarmHandler counting(&CountAlarm);
     gAlarms.store(0);
     const int threads = testsupport::CountThreads();
     auto* timer = new tKPusLinuxNanoSleepTimer();
@@ -76,7 +73,8 @@ TEST(TimerSlots, WithoutAThreadSetExpiryOnlyStoresAndDestructionIsQuiet) {
     EXPECT_TRUE(timer->state.expiry.tv_sec == 0 && timer->state.expiry.tv_nsec == 0);
     EXPECT_EQ(PalWakeSnapshot(timer->state.wakeWord), word) << "woke a thread that does not exist";
     delete timer;
-    sigaction(SIGALRM, &saved, &after);
+    struct sigaction after {};
+    sigaction(SIGALRM, nullptr, &after);
     EXPECT_TRUE(gAlarms.load() == 0 && after.sa_handler == &CountAlarm && testsupport::CountThreads() == threads);
 }
 
