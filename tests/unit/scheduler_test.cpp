@@ -16,7 +16,7 @@
 #include "quelta/quelta.h"
 
 using namespace quelta;
-using testsupport::MonoNowNs;
+using testsupport::Eventually, testsupport::MonoNowNs;
 
 namespace {
 
@@ -87,10 +87,11 @@ TEST_F(Scheduler, TicksKeepTheGridAndAreNeverReplayed) {
 }
 
 // Callback times are due at a pass exactly at them, given its now when no argument is set; NeverTime
-// cancels one; a set argument is what the callback gets.
+// cancels one; a null time is refused; a set argument is what the callback gets.
 TEST_F(Scheduler, CallbackTimesAreDueAtTheirTimeAndNeverTimeCancels) {
     quelta_iTSC_SetCallback(RecordCallback, nullptr);
     const uint64_t t = h.Now() + 100;
+    EXPECT_EQ(quelta_iTSC_SetCallbackTime(nullptr, 0) + quelta_iTSC_SetCallbackTime(nullptr, -1), 0u);  // nothing stored
     EXPECT_EQ(SetCallbackTime(t, 0) + SetCallbackTime(t, -1), 2u);
     EXPECT_EQ(h.timer->LastArmed(), t);  // earlier than the tick: armed
     PassAt(t);
@@ -135,13 +136,6 @@ TEST_F(Scheduler, NeverTimeGlobalCallbackTimeIsNeitherConvertedNorFolded) {
     h.Pass();
     EXPECT_EQ(h.timer->LastArmed(), h.Now() + kMs) << "a cancelled callback time was folded";
     EXPECT_TRUE(gCalls.empty());
-}
-
-TEST_F(Scheduler, TickCallbackUnregistrationAndControlFlag) {
-    iKPusTimingEngine* e = gEngine.load();
-    e->RegisterTickCallback(RecordTick), e->UnregisterTickCallback(nullptr);  // another function: cleared all the same
-    EXPECT_EQ(gTickCallback.load(), nullptr);
-    for (auto [set, flag] : {std::pair{1u, 1u}, {3u, 1u}, {2u, 0u}}) EXPECT_EQ((e->SetControlFlag(set), gControlFlag.load()), flag) << set;
 }
 
 // A deadline equal to now is due; nodes fire in list order (equal ones as they came), the rest is folded.
@@ -332,12 +326,6 @@ TEST_F(Scheduler, AfterAWallClockStepEveryDueNodeFiresWhereverItStands) {
 }
 
 
-template <typename F>
-bool Within(uint64_t ms, F done) {  // polls `done` for up to `ms`
-    for (const uint64_t end = MonoNowNs() + ms * kMs; !done(); usleep(200)) if (MonoNowNs() > end) return false;
-    return true;
-}
-
 // A wait on a thread of its own; one given up on is ended as unloading does, else the process fails.
 class Waiter {
 public:
@@ -346,9 +334,9 @@ public:
     ~Waiter() { ReturnsWithin(0); }
     bool ReturnsWithin(uint32_t ms) {
         if (!thread_.joinable()) return true;
-        const bool returned = Within(ms, [this] { return done_.load(); });
+        const bool returned = Eventually([this] { return done_.load(); }, ms * kMs);
         if (!returned) gStopping.store(true), WakeBlockedWaiters();
-        if (!Within(2000, [this] { return done_.load(); })) std::fprintf(stderr, "unstoppable wait\n"), _exit(1);
+        if (!Eventually([this] { return done_.load(); }, 2000 * kMs)) std::fprintf(stderr, "unstoppable wait\n"), _exit(1);
         thread_.join(), gStopping.store(false);
         return returned;
     }
@@ -392,7 +380,7 @@ TEST_F(EventWaits, ANewGenerationEndsOnlyAnAbortableGlobalWait) {
         uint32_t abortFlag = 77;
         ClockTime after{1, 2};
         Waiter waiter([&] { quelta_iTSC_WaitUntilGlobalClocks64_C(&target, row.flag ? &abortFlag : nullptr, &after, generation); });
-        ASSERT_TRUE(Within(1000, [] { return gWaitList.load() != nullptr; })) << "the wait was not queued";
+        ASSERT_TRUE(Eventually([] { return gWaitList.load() != nullptr; }, 1000 * kMs)) << "the wait was not queued";
         if (row.changedBack) {  // an abortable global node ahead of the waiter's, fired first
             gRestoredGeneration.store(generation);
             ASSERT_EQ(Queue(h.Take(1, 1, 1), before + 100 * kMs, 0, RestoreGeneration), 0u);
@@ -412,7 +400,7 @@ TEST_F(EventWaits, AStrayPostDoesNotEndAMonotonicWaitEarly) {
     uint32_t r = 99;
     Waiter waiter([&] { r = WaitOwn(deadline); });
     WaitNode* held = nullptr;
-    ASSERT_TRUE(Within(1000, [&] { for (WaitNode& n : h.pool) held = State(&n) == kHeld ? &n : held; return held != nullptr; }));
+    ASSERT_TRUE(Eventually([&] { for (WaitNode& n : h.pool) held = State(&n) == kHeld ? &n : held; return held != nullptr; }, 1000 * kMs));
     PalSemaphorePost(held->ownSemaphore.load());
     ASSERT_TRUE(waiter.ReturnsWithin(2000));
     EXPECT_EQ(std::tuple(r, MonoNowNs() >= deadline), std::tuple(0u, true)) << "ended early";
@@ -444,6 +432,13 @@ TEST_F(EventWaits, DeadlinesAtTheEdgesOfTheOrderBoundABlockingWait) {
         EXPECT_EQ(r, past ? 0u : 3u);
         if (past) { EXPECT_EQ(h.FreeNodes(), kWaitNodeCount); }
     }
+}
+
+// An event timeout becomes a 32-bit clock count: 4,294,968 us wraps to 704 clocks.
+TEST_F(EventWaits, TimeoutsWrapAsA32BitClockCount) {
+    const uint64_t t0 = MonoNowNs();
+    EXPECT_EQ(quelta_iTSCEvent_Wait_C(semaphore, 4294968u), 1u);
+    EXPECT_LT(MonoNowNs() - t0, 500 * kMs);
 }
 
 // Over up to fifty tries `wait` never takes under `ms`, and some try under `ms + 1` (an extra
@@ -490,7 +485,7 @@ TEST_F(EventWaits, WithoutTickServiceWaitsSleepWholeMillisecondsPlusOne) {
     }
     std::atomic<uint32_t> r{99};
     Waiter forever([&] { r.store(quelta_iTSCEvent_Wait_C(semaphore, 0xFFFFFFFFu)); });
-    EXPECT_FALSE(Within(30, [&] { return r.load() != 99u; })) << "no timeout, yet it ended";
+    EXPECT_FALSE(Eventually([&] { return r.load() != 99u; }, 30 * kMs)) << "no timeout, yet it ended";
     PalSemaphorePost(semaphore);
     EXPECT_TRUE(forever.ReturnsWithin(1000));
     EXPECT_EQ(r.load(), 0u);
