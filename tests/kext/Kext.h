@@ -59,7 +59,7 @@ constexpr const char* kConvertFile = "/sys/kernel/zq_syscall_clock_converttime";
 enum Counter : int {
     kWakeCalls, kWakesDelivered, kWakesLost,  // lost: the timer thread was not asleep (or a knob said so)
     kWakesUnknownTid, kWakesEchoed,           // echoed: a delivered wake that also ended the next sleep
-    kConvertMonoToReal, kConvertRealToMono, kConvertOther, kConvertRefused,
+    kConvertCalls,                            // every conversion call, served or refused
     kConvertByCallers,                        // served for threads other than a timer thread
     kOpensWakeFile, kOpensConvertFile,        // read-only opens of the sysfs files
     kTimerSleeps, kSleepsInterrupted,         // a timer thread's emulated sleeps; those a signal ended
@@ -75,8 +75,9 @@ struct SharedPage {
     std::atomic<int32_t> widenWindowUs{0};     // a sleep counts as asleep this long after it arrived
     std::atomic<int32_t> wakeReturnsEnosys{0};  // the wake call answers 38
     std::atomic<int32_t> echoWakes{0};         // a delivered wake ends the next sleep too, as a late one would
-    // REALTIME and MONOTONIC_RAW minus MONOTONIC, measured once: conversions are exact functions.
-    std::atomic<int64_t> realOffsetNs{0}, rawOffsetNs{0};
+    // REALTIME minus MONOTONIC, measured once: conversions are exact functions (the library converts
+    // only between these two; MONOTONIC_RAW is taken as MONOTONIC).
+    std::atomic<int64_t> realOffsetNs{0};
     std::atomic<int64_t> counters[kCounterCount] = {};
 
     Counts Snapshot() const {
@@ -251,8 +252,7 @@ private:
     }
 
     int64_t OffsetOf(int64_t clock) const {
-        if (clock == CLOCK_REALTIME) return realOffset_ + page_->skewNs.load(std::memory_order_relaxed);
-        return clock == CLOCK_MONOTONIC ? 0 : rawOffset_;
+        return clock == CLOCK_REALTIME ? realOffset_ + page_->skewNs.load(std::memory_order_relaxed) : 0;
     }
     int32_t Convert(const seccomp_notif& n, const ArchCalls& a) {
         const int pid = static_cast<int>(n.pid);
@@ -271,9 +271,6 @@ private:
         if (!Valid(n.id) || !Transfer(pid, n.data.args[2], out, a.narrowLong ? sizeof narrow : sizeof wide, true)) {
             return EFAULT;
         }
-        page_->Add(from == CLOCK_MONOTONIC && to == CLOCK_REALTIME   ? kConvertMonoToReal
-                   : from == CLOCK_REALTIME && to == CLOCK_MONOTONIC ? kConvertRealToMono
-                                                                     : kConvertOther);
         if (!IsTimer(pid, false)) page_->Add(kConvertByCallers);
         return 0;
     }
@@ -299,8 +296,8 @@ private:
         if (a == nullptr) return Continue(n.id);
         if (nr == kWakeNr) return HandleWake(n);
         if (nr == kConvertNr) {
+            page_->Add(kConvertCalls);
             const int32_t error = Convert(n, *a);
-            if (error != 0) page_->Add(kConvertRefused);
             return (void)Reply(n.id, error == 0 ? 0 : -1, -error);
         }
         if (nr == a->nanosleep32 || nr == a->nanosleep64) return HandleSleep(n, *a);
@@ -314,7 +311,7 @@ private:
     static constexpr int kMaxTimers = 8;
     int fd_, timer_ = timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC);
     SharedPage* page_;
-    int64_t realOffset_ = page_->realOffsetNs.load(), rawOffset_ = page_->rawOffsetNs.load();
+    int64_t realOffset_ = page_->realOffsetNs.load();
     Sleep sleeps_[8];
     int timers_[kMaxTimers] = {};
     unsigned nextTimer_ = 0;
@@ -380,7 +377,6 @@ public:
         if (shared == MAP_FAILED) return Fail("a shared page", errno);
         page_ = new (shared) SharedPage;
         page_->realOffsetNs.store(MeasureOffset(CLOCK_REALTIME));
-        page_->rawOffsetNs.store(MeasureOffset(CLOCK_MONOTONIC_RAW));
         int sv[2];
         if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, sv) != 0) return Fail("socketpair", errno);
         const pid_t parent = getpid(), child = fork();
