@@ -1,5 +1,5 @@
 // The running library with the wall clock moved through the clock seam (never the machine's): now, in
-// 2040 and in 2100 global reads, conversions, waits and callback times are exact, never early, never lost.
+// 2040 and in 2100 global reads, waits and callback times are exact, never early, never lost.
 #include <gtest/gtest.h>
 #include <stdlib.h>
 
@@ -34,8 +34,6 @@ void StoreGlobalNow(void*) {
     GetEngine__MERIDOX()->ReadGlobal2(g);
     gFiredAt.store(ToU64(g));
 }
-// The year of a global time (365.2425-day years from 1904; exact enough near a year's start).
-int YearOf(uint64_t global) { return 1904 + static_cast<int>(global / kNs / 31556952u); }
 
 class WallClockLive : public ::testing::TestWithParam<int64_t> {  // the wall clock's first second, Unix time
 protected:
@@ -54,7 +52,6 @@ protected:
         unsetenv("TZ");
     }
     uint64_t GlobalNow() { ClockTime g; engine->ReadGlobal2(g); return ToU64(g); }
-    uint64_t MonotonicNow() { ClockTime m; engine->ReadMonotonic0(m); return ToU64(m); }
     // Runs a blocking call on a thread of its own; still blocked after
     // kLostAfter, it is lost: false, and the stop releases the caller.
     template <typename Call>
@@ -98,7 +95,7 @@ protected:
     iKPusTimingEngine* engine = nullptr;
 };
 
-TEST_P(WallClockLive, ReadsConversionsAndEveryGlobalWaitEndAtTheirTime) {
+TEST_P(WallClockLive, ReadsAndEveryGlobalWaitEndAtTheirTime) {
     EXPECT_EQ(ComputeEpochOffset(), 2082844800);  // 1904 to 1970, in UTC
     timespec before{}, after{};
     ShiftedClock(CLOCK_REALTIME, &before);
@@ -106,22 +103,12 @@ TEST_P(WallClockLive, ReadsConversionsAndEveryGlobalWaitEndAtTheirTime) {
     ShiftedClock(CLOCK_REALTIME, &after);
     EXPECT_GE(g, JoinNanoseconds(before) + 2082844800ull * kNs);
     EXPECT_LE(g, JoinNanoseconds(after) + 2082844800ull * kNs);
-    if (GetParam() != 0) {
-        EXPECT_EQ(YearOf(g), YearOf((GetParam() + 2082844800ll) * kNs));
-    }
-    // The present converts to the present either way: within the reads around it (1 ms: room for a
-    // conversion whose own reads were preempted).
-    uint64_t first = GlobalNow(), converted = ToU64(engine->MonotonicToGlobal(FromU64(MonotonicNow())));
-    EXPECT_TRUE(first < converted + kMs && converted < GlobalNow() + kMs) << converted - first;
-    first = MonotonicNow(), converted = ToU64(engine->GlobalToMonotonic(FromU64(GlobalNow())));
-    EXPECT_TRUE(first < converted + kMs && converted < MonotonicNow() + kMs) << converted - first;
     for (uint64_t ahead : {0 * kMs, 3 * kMs, 25 * kMs}) GlobalWait(ahead);
     const ClockTime deadline = FromU64(GlobalNow() + 10 * kMs);
     uint32_t result = 9;  // neither semaphore nor callback: blocks on the node's own semaphore
     ASSERT_TRUE(EndsInTime([&] { result = quelta_iTSCEvent_Wait_Callback_C(nullptr, &deadline, nullptr, nullptr, 1, nullptr); }));
     EXPECT_EQ(result, 0u);
     EXPECT_GE(GlobalNow(), ToU64(deadline)) << "early";
-    EXPECT_LT(CallbackTakes(20 * kMs), kLostAfter);
 }
 
 TEST_P(WallClockLive, GlobalWaitsAndCallbackTimesFollowSteps) {

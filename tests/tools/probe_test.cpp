@@ -27,7 +27,6 @@
 
 #include "HistogramFile.h"
 #include "ProbeReport.h"
-#include "RuntimeSemaphore.h"
 #include "SvgPlot.h"
 #include "TestSupport.h"
 #include "TickGrid.h"
@@ -354,19 +353,6 @@ TEST(ProbeTrace, InstantsAndSpansOnCpuTracks) {
     ASSERT_EQ(lone.size(), 2u);
     EXPECT_TRUE(lone[0][2] == 31.0 && lone[1][0] == "wait 7") << lone[0] << lone[1];
 }
-
-// Keeps one post while nobody waits, times out not early (the surveys use the rest).
-TEST(ProbeSemaphore, KeepsOnePostTimesOutAndWakesAWaiter) {
-    PalSemaphore* s = nullptr;
-    ASSERT_EQ(RuntimeSemaphoreCreate(&s), 0);
-    EXPECT_TRUE(RuntimeSemaphorePost(s) == 0 && RuntimeSemaphorePost(s) == 0 && RuntimeSemaphorePending(s) == 1);
-    EXPECT_TRUE(RuntimeSemaphoreWait(s, 0) == 0u && RuntimeSemaphoreWait(s, 0) == 1u);
-    const auto start = std::chrono::steady_clock::now();
-    EXPECT_TRUE(RuntimeSemaphoreWait(s, 20) == 1u && std::chrono::steady_clock::now() - start >= std::chrono::milliseconds(20));
-    EXPECT_TRUE(s->waiters == 0 && s->count == 0 && RuntimeSemaphoreDestroy(nullptr) == 22);
-    EXPECT_EQ(RuntimeSemaphoreDestroy(s), 0);
-}
-
 
 const std::string kProbe = std::string(QUELTA_BINARY_DIR) + "/tools/quelta-probe", kSource = QUELTA_SOURCE_DIR;
 const char* const kSeries[] = {"baseline", "plain-wait", "tick", "event-own-sem", "event-timeout", "global-wait",
