@@ -296,10 +296,10 @@ void Sweep(int64_t from, int64_t to) {
         for (; !stuck && rounds < QUELTA_WAKE_SWEEP_ROUNDS && lost < 3; ++rounds) {
             const int64_t offset = OffsetOf(seen - 1);  // the round of the callback just seen
             if (offset > 0) SpinFor(static_cast<uint64_t>(offset));
-            const uint64_t set = MonoNowNs();
             timer->ExpireNow();
+            const uint64_t set = MonoNowNs();  // after the wake: a waker held off the CPU before it loses nothing
             stuck = !WaitForCallback(++seen, 2 * kOldDeadline);  // not even the old deadline came
-            lost += gLastCallback.load() - set > kLost;
+            lost += static_cast<int64_t>(gLastCallback.load() - set) > static_cast<int64_t>(kLost);
         }
     });
     waker.join();
