@@ -7,7 +7,7 @@
 // - sched_wake_up(tid) ends that timer thread's sleep with -EAGAIN; a wake that
 //   finds it not asleep is lost.
 // - clock_converttime converts in the caller's own timespec layout, the wall
-//   clock moved by the skew knob; an unknown clock or overflow fails.
+//   clock moved by the skew knob; another clock (MONOTONIC_RAW too) or overflow fails.
 // - A timer thread's monotonic clock_nanosleep ends at its deadline or on a
 //   wake; other sleeps go to the kernel; a signalled thread sees EINTR.
 // - Read-only opens of the sysfs files, and SIGALRMs to a timer thread, are
@@ -75,8 +75,8 @@ struct SharedPage {
     std::atomic<int32_t> widenWindowUs{0};     // a sleep counts as asleep this long after it arrived
     std::atomic<int32_t> wakeReturnsEnosys{0};  // the wake call answers 38
     std::atomic<int32_t> echoWakes{0};         // a delivered wake ends the next sleep too, as a late one would
-    // REALTIME minus MONOTONIC, measured once: conversions are exact functions (the library converts
-    // only between these two; MONOTONIC_RAW is taken as MONOTONIC).
+    // REALTIME minus MONOTONIC, measured once: conversions are exact functions (the tests convert
+    // only between these two; any other clock, MONOTONIC_RAW too, is refused, not guessed).
     std::atomic<int64_t> realOffsetNs{0};
     std::atomic<int64_t> counters[kCounterCount] = {};
 
@@ -258,7 +258,7 @@ private:
         const int pid = static_cast<int>(n.pid);
         const int64_t from = static_cast<int32_t>(n.data.args[0]), to = static_cast<int32_t>(n.data.args[1]);
         for (int64_t c : {from, to}) {
-            if (c != CLOCK_REALTIME && c != CLOCK_MONOTONIC && c != CLOCK_MONOTONIC_RAW) return EINVAL;
+            if (c != CLOCK_REALTIME && c != CLOCK_MONOTONIC) return EINVAL;
         }
         int64_t sec, nsec;
         if (!ReadTimespec(pid, n.data.args[2], a.narrowLong, false, sec, nsec)) return EINVAL;  // out of range (the library's pointers are good)
