@@ -1,4 +1,5 @@
-// Every call through the loaded library: never early, results as the README's table says, bad input refused.
+// Calls through the loaded library: global waits already due, signals that shorten no wait, bad input refused
+// as the README's table says, no page fault after a first call.
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/resource.h>
